@@ -1,0 +1,491 @@
+#include "cf/value.h"
+
+#include <algorithm>
+#include <cctype>
+#include <cmath>
+#include <cstdio>
+#include <ctime>
+#include <functional>
+#include <limits>
+
+namespace cf {
+
+namespace {
+
+using Int128 = __int128;
+
+template <typename T>
+T SaturatingTruncate(double d) {
+  if (std::isnan(d)) return 0;
+  d = std::trunc(d);
+  // Compare in long double so the bounds are exact for 64-bit targets.
+  const long double ld = d;
+  if (ld <= static_cast<long double>(std::numeric_limits<T>::min())) return std::numeric_limits<T>::min();
+  if (ld >= static_cast<long double>(std::numeric_limits<T>::max())) return std::numeric_limits<T>::max();
+  return static_cast<T>(d);
+}
+
+uint64_t LowBits(NumberType type, int64_t v) {
+  switch (type) {
+    case NumberType::kSInt8:
+      return static_cast<uint64_t>(static_cast<int64_t>(static_cast<int8_t>(v)));
+    case NumberType::kSInt16:
+      return static_cast<uint64_t>(static_cast<int64_t>(static_cast<int16_t>(v)));
+    case NumberType::kSInt32:
+    case NumberType::kInt:
+      return static_cast<uint64_t>(static_cast<int64_t>(static_cast<int32_t>(v)));
+    default:
+      return static_cast<uint64_t>(v);
+  }
+}
+
+size_t Mix(size_t h, size_t v) { return h ^ (v + 0x9e3779b97f4a7c15ULL + (h << 6) + (h >> 2)); }
+
+}  // namespace
+
+bool IsValidNumberType(int code) {
+  switch (code) {
+    case 1: case 2: case 3: case 4: case 5: case 6: case 9: case 12: case 13: case 100:
+      return true;
+    default:
+      return false;
+  }
+}
+
+bool Number::IsFloat() const {
+  return type_ == NumberType::kFloat32 || type_ == NumberType::kFloat64 ||
+         type_ == NumberType::kFloat || type_ == NumberType::kDouble;
+}
+
+Number Number::Make(NumberType type, int64_t v) {
+  Number n;
+  n.type_ = type;
+  if (n.IsFloat()) {
+    n.real_ = (type == NumberType::kFloat32 || type == NumberType::kFloat)
+                  ? static_cast<double>(static_cast<float>(v))
+                  : static_cast<double>(v);
+  } else {
+    n.bits_ = LowBits(type, v);
+  }
+  return n;
+}
+
+Number Number::MakeDouble(NumberType type, double v) {
+  Number n;
+  n.type_ = type;
+  if (n.IsFloat()) {
+    n.real_ = (type == NumberType::kFloat32 || type == NumberType::kFloat)
+                  ? static_cast<double>(static_cast<float>(v))
+                  : v;
+  } else if (type == NumberType::kUInt64) {
+    n.bits_ = v < 0 ? static_cast<uint64_t>(SaturatingTruncate<int64_t>(v))
+                    : SaturatingTruncate<uint64_t>(v);
+  } else {
+    n.bits_ = LowBits(type, SaturatingTruncate<int64_t>(v));
+  }
+  return n;
+}
+
+Number Number::UInt64(uint64_t v) {
+  Number n;
+  n.type_ = NumberType::kUInt64;
+  n.bits_ = v;
+  return n;
+}
+
+int64_t Number::AsSInt64() const {
+  if (IsFloat()) return SaturatingTruncate<int64_t>(real_);
+  return static_cast<int64_t>(bits_);
+}
+
+uint64_t Number::AsUInt64() const {
+  if (IsFloat()) {
+    // Negative reals go through the signed path so -1.0 reads as 2^64-1,
+    // as the low bits of -1 would.
+    if (real_ < 0) return static_cast<uint64_t>(SaturatingTruncate<int64_t>(real_));
+    return SaturatingTruncate<uint64_t>(real_);
+  }
+  return bits_;
+}
+
+double Number::AsFloat64() const {
+  if (IsFloat()) return real_;
+  if (IsUnsigned()) return static_cast<double>(bits_);
+  return static_cast<double>(static_cast<int64_t>(bits_));
+}
+
+int Number::Compare(const Number& o) const {
+  if (!IsFloat() && !o.IsFloat()) {
+    const Int128 a = IsUnsigned() ? Int128(bits_) : Int128(static_cast<int64_t>(bits_));
+    const Int128 b = o.IsUnsigned() ? Int128(o.bits_) : Int128(static_cast<int64_t>(o.bits_));
+    return a < b ? -1 : (a > b ? 1 : 0);
+  }
+  // long double holds every 64-bit integer exactly, so mixed comparisons are exact.
+  auto wide = [](const Number& n) -> long double {
+    if (n.IsFloat()) return n.real_;
+    if (n.IsUnsigned()) return static_cast<long double>(n.bits_);
+    return static_cast<long double>(static_cast<int64_t>(n.bits_));
+  };
+  const long double a = wide(*this), b = wide(o);
+  if (std::isnan(a) || std::isnan(b)) {
+    if (std::isnan(a) && std::isnan(b)) return 0;
+    return std::isnan(a) ? 1 : -1;  // NaN sorts last and equals only NaN
+  }
+  return a < b ? -1 : (a > b ? 1 : 0);
+}
+
+bool Number::operator==(const Number& o) const { return Compare(o) == 0; }
+
+size_t Number::Hash() const {
+  // Equal numbers of different types must hash alike: hash integral values
+  // as integers and everything else by the bits of the double.
+  if (!IsFloat()) {
+    const Int128 v = IsUnsigned() ? Int128(bits_) : Int128(static_cast<int64_t>(bits_));
+    return Mix(std::hash<uint64_t>()(static_cast<uint64_t>(v)), static_cast<size_t>(v >> 64));
+  }
+  const double d = real_;
+  if (std::isfinite(d) && std::trunc(d) == d && std::fabs(d) < 18446744073709551616.0) {
+    const Int128 v = d < 0 ? Int128(static_cast<int64_t>(d)) : Int128(static_cast<uint64_t>(d));
+    return Mix(std::hash<uint64_t>()(static_cast<uint64_t>(v)), static_cast<size_t>(v >> 64));
+  }
+  if (std::isnan(d)) return 0x7ff8;
+  return std::hash<double>()(d);
+}
+
+std::string Number::Description() const {
+  char buf[64];
+  if (IsFloat()) {
+    std::snprintf(buf, sizeof buf, "%0.16g", real_);
+  } else if (IsUnsigned()) {
+    std::snprintf(buf, sizeof buf, "%llu", static_cast<unsigned long long>(bits_));
+  } else {
+    std::snprintf(buf, sizeof buf, "%lld", static_cast<long long>(static_cast<int64_t>(bits_)));
+  }
+  return buf;
+}
+
+// ---- containers ----
+
+class ArrayImpl {
+ public:
+  std::vector<Value> items;
+};
+
+class DictionaryImpl {
+ public:
+  std::vector<std::pair<Value, Value>> entries;
+  std::vector<size_t> hashes;
+  // Open-addressing index into entries (slot value = index + 1); built only
+  // once the dictionary is large enough for a linear scan to hurt.
+  std::vector<uint32_t> slots;
+
+  static constexpr size_t kIndexThreshold = 12;
+
+  long FindIndex(const Value& key) const {
+    const size_t h = key.Hash();
+    if (slots.empty()) {
+      for (size_t i = 0; i < entries.size(); ++i)
+        if (hashes[i] == h && entries[i].first == key) return static_cast<long>(i);
+      return -1;
+    }
+    const size_t mask = slots.size() - 1;
+    for (size_t s = h & mask;; s = (s + 1) & mask) {
+      const uint32_t slot = slots[s];
+      if (slot == 0) return -1;
+      const size_t i = slot - 1;
+      if (hashes[i] == h && entries[i].first == key) return static_cast<long>(i);
+    }
+  }
+
+  void Insert(size_t i) {
+    const size_t mask = slots.size() - 1;
+    size_t s = hashes[i] & mask;
+    while (slots[s] != 0) s = (s + 1) & mask;
+    slots[s] = static_cast<uint32_t>(i + 1);
+  }
+
+  void Rebuild(size_t capacity_hint) {
+    slots.clear();
+    const size_t n = std::max(capacity_hint, entries.size());
+    if (n < kIndexThreshold) return;
+    size_t cap = 16;
+    while (cap < n * 2) cap <<= 1;
+    slots.assign(cap, 0);
+    for (size_t i = 0; i < entries.size(); ++i) Insert(i);
+  }
+
+  void Append(Value key, Value value) {
+    hashes.push_back(key.Hash());
+    entries.emplace_back(std::move(key), std::move(value));
+    if (slots.empty()) {
+      if (entries.size() >= kIndexThreshold) Rebuild(entries.size());
+    } else if (entries.size() * 2 > slots.size()) {
+      Rebuild(entries.size());
+    } else {
+      Insert(entries.size() - 1);
+    }
+  }
+};
+
+Array::Array() : impl_(std::make_shared<ArrayImpl>()) {}
+Array::Array(std::vector<Value> items) : impl_(std::make_shared<ArrayImpl>()) {
+  impl_->items = std::move(items);
+}
+size_t Array::size() const { return impl_->items.size(); }
+const Value& Array::operator[](size_t i) const { return impl_->items[i]; }
+const Value& Array::at(size_t i) const {
+  static const Value kNull;
+  return i < impl_->items.size() ? impl_->items[i] : kNull;
+}
+void Array::Append(Value v) { impl_->items.push_back(std::move(v)); }
+void Array::Set(size_t i, Value v) {
+  if (i < impl_->items.size()) impl_->items[i] = std::move(v);
+  else if (i == impl_->items.size()) impl_->items.push_back(std::move(v));
+}
+void Array::RemoveAt(size_t i) {
+  if (i < impl_->items.size()) impl_->items.erase(impl_->items.begin() + static_cast<long>(i));
+}
+void Array::Clear() { impl_->items.clear(); }
+const std::vector<Value>& Array::items() const { return impl_->items; }
+std::vector<Value>::const_iterator Array::begin() const { return impl_->items.begin(); }
+std::vector<Value>::const_iterator Array::end() const { return impl_->items.end(); }
+Array Array::MutableCopy() const { return Array(impl_->items); }
+
+Dictionary::Dictionary() : impl_(std::make_shared<DictionaryImpl>()) {}
+size_t Dictionary::size() const { return impl_->entries.size(); }
+const Value* Dictionary::Find(const Value& key) const {
+  const long i = impl_->FindIndex(key);
+  return i < 0 ? nullptr : &impl_->entries[static_cast<size_t>(i)].second;
+}
+Value Dictionary::Get(const Value& key) const {
+  const Value* v = Find(key);
+  return v ? *v : Value();
+}
+void Dictionary::Set(Value key, Value value) {
+  const long i = impl_->FindIndex(key);
+  if (i >= 0) {
+    impl_->entries[static_cast<size_t>(i)].second = std::move(value);
+    return;
+  }
+  impl_->Append(std::move(key), std::move(value));
+}
+void Dictionary::AppendUnique(Value key, Value value) { impl_->Append(std::move(key), std::move(value)); }
+void Dictionary::Remove(const Value& key) {
+  const long i = impl_->FindIndex(key);
+  if (i < 0) return;
+  impl_->entries.erase(impl_->entries.begin() + i);
+  impl_->hashes.erase(impl_->hashes.begin() + i);
+  impl_->Rebuild(0);
+}
+void Dictionary::Clear() {
+  impl_->entries.clear();
+  impl_->hashes.clear();
+  impl_->slots.clear();
+}
+void Dictionary::Reserve(size_t n) {
+  impl_->entries.reserve(n);
+  impl_->hashes.reserve(n);
+  if (n >= DictionaryImpl::kIndexThreshold && impl_->slots.size() < n * 2) impl_->Rebuild(n);
+}
+const std::vector<std::pair<Value, Value>>& Dictionary::entries() const { return impl_->entries; }
+std::vector<std::pair<Value, Value>>::const_iterator Dictionary::begin() const {
+  return impl_->entries.begin();
+}
+std::vector<std::pair<Value, Value>>::const_iterator Dictionary::end() const {
+  return impl_->entries.end();
+}
+Dictionary Dictionary::MutableCopy() const {
+  Dictionary d;
+  *d.impl_ = *impl_;
+  return d;
+}
+
+// ---- Value ----
+
+const char* TypeName(Type t) {
+  switch (t) {
+    case Type::kNull: return "null";
+    case Type::kBoolean: return "boolean";
+    case Type::kNumber: return "number";
+    case Type::kString: return "string";
+    case Type::kData: return "data";
+    case Type::kDate: return "date";
+    case Type::kArray: return "array";
+    case Type::kDictionary: return "dictionary";
+  }
+  return "?";
+}
+
+const Data* Value::AsData() const {
+  auto p = std::get_if<std::shared_ptr<const Data>>(&v_);
+  return p ? p->get() : nullptr;
+}
+
+bool Value::operator==(const Value& o) const {
+  if (type() != o.type()) return false;
+  switch (type()) {
+    case Type::kNull: return true;
+    case Type::kBoolean: return *AsBool() == *o.AsBool();
+    case Type::kNumber: return *AsNumber() == *o.AsNumber();
+    case Type::kString: return *AsString() == *o.AsString();
+    case Type::kData: return *AsData() == *o.AsData();
+    case Type::kDate: return *AsDate() == *o.AsDate();
+    case Type::kArray: {
+      const Array& a = *AsArray();
+      const Array& b = *o.AsArray();
+      if (a.SameAs(b)) return true;
+      return a.items() == b.items();
+    }
+    case Type::kDictionary: {
+      const Dictionary& a = *AsDictionary();
+      const Dictionary& b = *o.AsDictionary();
+      if (a.SameAs(b)) return true;
+      if (a.size() != b.size()) return false;
+      for (const auto& [k, v] : a) {
+        const Value* other = b.Find(k);
+        if (!other || !(*other == v)) return false;
+      }
+      return true;
+    }
+  }
+  return false;
+}
+
+size_t Value::Hash() const {
+  const size_t t = static_cast<size_t>(type());
+  switch (type()) {
+    case Type::kNull: return 0x51;
+    case Type::kBoolean: return Mix(t, *AsBool());
+    // Numbers hash without their type tag so 3 and 3.0 land together.
+    case Type::kNumber: return AsNumber()->Hash();
+    case Type::kString: return std::hash<std::string>()(*AsString());
+    case Type::kData:
+      return Mix(t, std::hash<std::string_view>()(std::string_view(
+                        reinterpret_cast<const char*>(AsData()->data()), AsData()->size())));
+    case Type::kDate: return Mix(t, std::hash<double>()(AsDate()->seconds));
+    // Containers hash by size only: cheap, and consistent with element-wise
+    // equality (dictionary order does not matter).
+    case Type::kArray: return Mix(t, AsArray()->size());
+    case Type::kDictionary: return Mix(t, AsDictionary()->size());
+  }
+  return 0;
+}
+
+std::string DateDescription(const Date& d) {
+  const time_t secs = static_cast<time_t>(std::floor(d.seconds));
+  struct tm tm;
+  gmtime_r(&secs, &tm);
+  char buf[64];
+  std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+  return buf;
+}
+
+namespace {
+
+bool NeedsQuotes(const std::string& s) {
+  if (s.empty()) return true;
+  for (unsigned char c : s)
+    if (!(std::isalnum(c) || c == '_' || c == '.' || c == '-' || c >= 0x80)) return true;
+  return false;
+}
+
+std::string Quoted(const std::string& s) {
+  if (!NeedsQuotes(s)) return s;
+  std::string out = "\"";
+  for (char c : s) {
+    if (c == '"' || c == '\\') out += '\\';
+    if (c == '\n') {
+      out += "\\n";
+      continue;
+    }
+    out += c;
+  }
+  return out + "\"";
+}
+
+void Describe(const Value& v, int depth, bool nested, std::string& out) {
+  const std::string pad(static_cast<size_t>(depth) * 4, ' ');
+  const std::string inner(static_cast<size_t>(depth + 1) * 4, ' ');
+  switch (v.type()) {
+    case Type::kNull: out += "<null>"; return;
+    case Type::kBoolean: out += *v.AsBool() ? "true" : "false"; return;
+    case Type::kNumber: out += v.AsNumber()->Description(); return;
+    case Type::kString: out += nested ? Quoted(*v.AsString()) : *v.AsString(); return;
+    case Type::kDate: out += DateDescription(*v.AsDate()); return;
+    case Type::kData: {
+      static const char* hex = "0123456789abcdef";
+      out += '<';
+      const Data& d = *v.AsData();
+      for (size_t i = 0; i < d.size(); ++i) {
+        if (i && i % 4 == 0) out += ' ';
+        out += hex[d[i] >> 4];
+        out += hex[d[i] & 15];
+      }
+      out += '>';
+      return;
+    }
+    case Type::kArray: {
+      const Array& a = *v.AsArray();
+      if (a.empty()) {
+        out += "()";
+        return;
+      }
+      out += "(\n";
+      for (size_t i = 0; i < a.size(); ++i) {
+        out += inner;
+        Describe(a[i], depth + 1, true, out);
+        out += i + 1 < a.size() ? ",\n" : "\n";
+      }
+      out += pad + ")";
+      return;
+    }
+    case Type::kDictionary: {
+      const Dictionary& d = *v.AsDictionary();
+      if (d.empty()) {
+        out += "{}";
+        return;
+      }
+      out += "{\n";
+      for (const auto& [k, val] : d) {
+        out += inner;
+        Describe(k, depth + 1, true, out);
+        out += " = ";
+        Describe(val, depth + 1, true, out);
+        out += ";\n";
+      }
+      out += pad + "}";
+      return;
+    }
+  }
+}
+
+}  // namespace
+
+std::string Value::Description() const {
+  std::string out;
+  Describe(*this, 0, false, out);
+  return out;
+}
+
+Value Value::MutableCopy() const {
+  if (auto a = AsArray()) return a->MutableCopy();
+  if (auto d = AsDictionary()) return d->MutableCopy();
+  return *this;
+}
+
+Value Value::DeepCopy() const {
+  if (auto a = AsArray()) {
+    Array out;
+    for (const Value& item : *a) out.Append(item.DeepCopy());
+    return out;
+  }
+  if (auto d = AsDictionary()) {
+    Dictionary out;
+    out.Reserve(d->size());
+    for (const auto& [k, v] : *d) out.AppendUnique(k.DeepCopy(), v.DeepCopy());
+    return out;
+  }
+  return *this;
+}
+
+}  // namespace cf

@@ -1,0 +1,57 @@
+// Wall clock and monotonic clock.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string_view>
+
+namespace platform {
+
+class Clock {
+ public:
+  virtual ~Clock() = default;
+  // Seconds since 1970-01-01T00:00:00Z.
+  virtual double Now() = 0;
+  // Nanoseconds of CLOCK_MONOTONIC (does not advance in suspend).
+  virtual uint64_t MonotonicNanos() = 0;
+};
+
+// time(), or the fixed instant of TALLYRUN_NOW when it is set and valid.
+class SystemClock : public Clock {
+ public:
+  SystemClock();
+  double Now() override;
+  uint64_t MonotonicNanos() override;
+
+ private:
+  std::optional<double> fixed_;
+};
+
+// A clock that tests set by hand.
+class FixedClock : public Clock {
+ public:
+  explicit FixedClock(double now) : now_(now) {}
+  double Now() override { return now_; }
+  uint64_t MonotonicNanos() override { return mono_; }
+  void Set(double now) { now_ = now; }
+  void AdvanceMonotonic(uint64_t ns) { mono_ += ns; }
+
+ private:
+  double now_;
+  uint64_t mono_ = 1'000'000'000;
+};
+
+// Epoch seconds ("1700000000", "-5.5") or an ISO-8601 date-time
+// ("2026-11-22T10:00:00Z", "2026-11-22T10:00:00+02:00", "2026-11-22 10:00",
+// "2026-11-22"); without a zone the time is local (TZ). Nothing for other text.
+std::optional<double> ParseInstant(std::string_view text);
+
+// Civil calendar arithmetic (proleptic Gregorian), days relative to 1970-01-01.
+int64_t DaysFromCivil(int64_t year, unsigned month, unsigned day);
+void CivilFromDays(int64_t days, int64_t* year, unsigned* month, unsigned* day);
+
+// Shorthands over the current context's clock.
+double Now();
+uint64_t MonotonicNanos();
+
+}  // namespace platform

@@ -1,0 +1,71 @@
+#include "platform/context.h"
+
+#include <cstdlib>
+
+#include "platform/clock.h"
+#include "platform/log.h"
+#include "platform/prefs.h"
+#include "platform/store.h"
+
+namespace platform {
+
+namespace {
+
+Context* g_current = nullptr;
+
+Context& DefaultContext() {
+  // Built once from the environment and never destroyed, so services stay
+  // usable from exit handlers.
+  static Context* context = [] {
+    auto* c = new Context(EnvOr("TALLYRUN_ROOT", "/var/lib/tallyrun"), Backends{});
+    std::atexit([] {
+      if (g_current == nullptr) DefaultContext().preferences().SynchronizeAll();
+    });
+    return c;
+  }();
+  return *context;
+}
+
+}  // namespace
+
+std::string EnvOr(const char* name, const char* fallback) {
+  const char* v = std::getenv(name);
+  return v && *v ? std::string(v) : std::string(fallback);
+}
+
+Context& Context::Current() { return g_current ? *g_current : DefaultContext(); }
+
+Context::Context(std::string root, Backends backends) : root_(std::move(root)), backends_(std::move(backends)) {
+  while (root_.size() > 1 && root_.back() == '/') root_.pop_back();
+  if (!backends_.clock) backends_.clock = std::make_shared<SystemClock>();
+  if (!backends_.log) backends_.log = std::make_shared<SyslogSink>();
+  preferences_ = std::make_unique<Preferences>(Path("/Library/Preferences"));
+}
+
+Context::~Context() = default;
+
+std::string Context::Path(std::string_view device_path) const {
+  std::string out = root_ == "/" ? std::string() : root_;
+  if (device_path.empty() || device_path.front() != '/') out += '/';
+  out += device_path;
+  return out;
+}
+
+TallyStore* Context::store(std::string* error) {
+  if (!store_ && !store_tried_) {
+    store_tried_ = true;
+    store_ = TallyStore::Open(Path(kStoreDevicePath), TallyStore::Mode::kCreate, &store_error_);
+    if (!store_) LogError("Tallybook store unavailable: %s", store_error_);
+  }
+  if (!store_ && error) *error = store_error_;
+  return store_.get();
+}
+
+ContextScope::ContextScope(std::string root, Backends backends)
+    : context_(std::make_unique<Context>(std::move(root), std::move(backends))), previous_(g_current) {
+  g_current = context_.get();
+}
+
+ContextScope::~ContextScope() { g_current = previous_; }
+
+}  // namespace platform

@@ -1,0 +1,73 @@
+// The process-wide platform context: the device root and the installed
+// backends. Production code reaches every service through Context::Current();
+// tests install their own with a ContextScope.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+
+namespace platform {
+
+class Clock;
+class LogSink;
+class Preferences;
+class TallyStore;
+
+struct Backends {
+  std::shared_ptr<Clock> clock;  // default: system clock honouring TALLYRUN_NOW
+  std::shared_ptr<LogSink> log;  // default: syslog (mirrored to stderr on request)
+};
+
+class Context {
+ public:
+  // The root and backends from the environment: TALLYRUN_ROOT (default
+  // /var/lib/tallyrun), TALLYRUN_NOW, TALLYRUN_LOG_STDERR, TALLYRUN_LOG_DEBUG.
+  static Context& Current();
+
+  Context(std::string root, Backends backends);
+  ~Context();
+  Context(const Context&) = delete;
+  Context& operator=(const Context&) = delete;
+
+  const std::string& root() const { return root_; }
+  // Resolves a device path such as "/var/run/x.sock" under the root.
+  std::string Path(std::string_view device_path) const;
+
+  Clock& clock() { return *backends_.clock; }
+  LogSink& log() { return *backends_.log; }
+  Preferences& preferences() { return *preferences_; }
+  // The store client's connection, opened on first use; null (with a reason
+  // in *error) when the store cannot be opened.
+  TallyStore* store(std::string* error = nullptr);
+
+ private:
+  friend class ContextScope;
+  std::string root_;
+  Backends backends_;
+  std::unique_ptr<Preferences> preferences_;
+  std::unique_ptr<TallyStore> store_;
+  std::string store_error_;
+  bool store_tried_ = false;
+};
+
+// Installs a context for the life of the scope and restores the previous one.
+// Pending preference changes of the scoped context are discarded unless
+// synchronized, as at a crash.
+class ContextScope {
+ public:
+  explicit ContextScope(std::string root, Backends backends = {});
+  ~ContextScope();
+  ContextScope(const ContextScope&) = delete;
+  ContextScope& operator=(const ContextScope&) = delete;
+  Context& context() { return *context_; }
+
+ private:
+  std::unique_ptr<Context> context_;
+  Context* previous_;
+};
+
+// Environment lookup with a default, shared by the backends.
+std::string EnvOr(const char* name, const char* fallback);
+
+}  // namespace platform

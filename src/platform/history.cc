@@ -1,0 +1,133 @@
+#include "platform/history.h"
+
+#include <sqlite3.h>
+
+#include "platform/context.h"
+#include "platform/files.h"
+#include "platform/log.h"
+#include "platform/store.h"
+
+namespace platform {
+
+namespace {
+
+// Rows whose key starts with the prefix: a range on the key, so the empty
+// prefix costs nothing and a long one uses the ordering of the text.
+constexpr const char* kPrefixClause =
+    " AND (?3 = '' OR (key >= ?3 AND substr(key, 1, length(?3)) = ?3))";
+
+class ReadTransaction {
+ public:
+  explicit ReadTransaction(sqlite3* db) : db_(db) { ok_ = sqlite3_exec(db, "BEGIN", nullptr, nullptr, nullptr) == SQLITE_OK; }
+  ~ReadTransaction() {
+    if (ok_) sqlite3_exec(db_, "COMMIT", nullptr, nullptr, nullptr);
+  }
+  bool ok() const { return ok_; }
+
+ private:
+  sqlite3* db_;
+  bool ok_;
+};
+
+struct Finalizer {
+  void operator()(sqlite3_stmt* s) const { sqlite3_finalize(s); }
+};
+using StatementPtr = std::unique_ptr<sqlite3_stmt, Finalizer>;
+
+StatementPtr Prepare(sqlite3* db, const std::string& sql) {
+  sqlite3_stmt* s = nullptr;
+  if (sqlite3_prepare_v2(db, sql.c_str(), -1, &s, nullptr) != SQLITE_OK) {
+    LogError("Tallybook history query failed: %s", sqlite3_errmsg(db));
+    return nullptr;
+  }
+  return StatementPtr(s);
+}
+
+void BindRange(sqlite3_stmt* s, std::string_view prefix, int32_t min_day, int32_t max_day) {
+  sqlite3_bind_int(s, 1, min_day);
+  sqlite3_bind_int(s, 2, max_day);
+  sqlite3_bind_text(s, 3, prefix.data(), static_cast<int>(prefix.size()), SQLITE_STATIC);
+}
+
+}  // namespace
+
+bool TBHistoryDistributionEnumerator::getNextValue(double* value, int32_t* secondsInDayOffset) {
+  if (done_ || !stmt_) return false;
+  if (sqlite3_step(stmt_) != SQLITE_ROW) {
+    done_ = true;
+    return false;
+  }
+  if (value) *value = sqlite3_column_double(stmt_, 0);
+  if (secondsInDayOffset) *secondsInDayOffset = sqlite3_column_int(stmt_, 1);
+  return true;
+}
+
+std::unique_ptr<TBHistory> TBHistory::initWithDefaultPath(std::string* error) {
+  return initWithPath(Context::Current().Path(kStoreDevicePath), error);
+}
+
+std::unique_ptr<TBHistory> TBHistory::initWithPath(const std::string& path, std::string* error) {
+  // Check the file through the store's own open, which refuses foreign files
+  // without touching them and brings an empty store up to the schema.
+  std::string why;
+  if (!TallyStore::Open(path, TallyStore::Mode::kExisting, &why)) {
+    if (error) *error = why;
+    return nullptr;
+  }
+  sqlite3* db = nullptr;
+  if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK) {
+    if (error) *error = db ? sqlite3_errmsg(db) : "out of memory";
+    sqlite3_close(db);
+    return nullptr;
+  }
+  sqlite3_busy_timeout(db, 30000);
+  return std::unique_ptr<TBHistory>(new TBHistory(db));
+}
+
+TBHistory::~TBHistory() { sqlite3_close_v2(db_); }
+
+bool TBHistory::scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
+                                    const ScalarHandler& rowHandler) {
+  ReadTransaction txn(db_);
+  if (!txn.ok()) return false;
+  StatementPtr rows = Prepare(db_, std::string("SELECT key, day, value FROM scalars WHERE day BETWEEN ?1 AND ?2") +
+                                       kPrefixClause + " ORDER BY day, key");
+  if (!rows) return false;
+  BindRange(rows.get(), prefix, minDaysSince1970, maxDaysSince1970);
+  std::string key;
+  int rc;
+  while ((rc = sqlite3_step(rows.get())) == SQLITE_ROW) {
+    key.assign(reinterpret_cast<const char*>(sqlite3_column_text(rows.get(), 0)),
+               static_cast<size_t>(sqlite3_column_bytes(rows.get(), 0)));
+    bool stop = false;
+    rowHandler(key, sqlite3_column_int(rows.get(), 1), sqlite3_column_int64(rows.get(), 2), &stop);
+    if (stop) return true;
+  }
+  return rc == SQLITE_DONE;
+}
+
+bool TBHistory::distributionsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970,
+                                          int32_t maxDaysSince1970, const DistributionHandler& rowHandler) {
+  ReadTransaction txn(db_);
+  if (!txn.ok()) return false;
+  StatementPtr rows = Prepare(db_, std::string("SELECT id, key, day FROM series WHERE day BETWEEN ?1 AND ?2") +
+                                       kPrefixClause + " ORDER BY day, key");
+  StatementPtr samples = Prepare(db_, "SELECT value, offset FROM samples WHERE series = ?1 ORDER BY seq");
+  if (!rows || !samples) return false;
+  BindRange(rows.get(), prefix, minDaysSince1970, maxDaysSince1970);
+  std::string key;
+  int rc;
+  while ((rc = sqlite3_step(rows.get())) == SQLITE_ROW) {
+    key.assign(reinterpret_cast<const char*>(sqlite3_column_text(rows.get(), 1)),
+               static_cast<size_t>(sqlite3_column_bytes(rows.get(), 1)));
+    sqlite3_reset(samples.get());
+    sqlite3_bind_int64(samples.get(), 1, sqlite3_column_int64(rows.get(), 0));
+    TBHistoryDistributionEnumerator enumerator(samples.get());
+    bool stop = false;
+    rowHandler(key, sqlite3_column_int(rows.get(), 2), enumerator, &stop);
+    if (stop) return true;
+  }
+  return rc == SQLITE_DONE;
+}
+
+}  // namespace platform

@@ -1,0 +1,56 @@
+// Reading the store's history. Each call reads inside one read transaction,
+// so the rows are one consistent view while writers go on, and calls its
+// handler once per row, synchronously. Samples stream from the database:
+// memory stays flat however many samples a day has.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace platform {
+
+class TBHistoryDistributionEnumerator {
+ public:
+  // False when no sample is left.
+  bool getNextValue(double* value, int32_t* secondsInDayOffset);
+
+ private:
+  friend class TBHistory;
+  explicit TBHistoryDistributionEnumerator(sqlite3_stmt* stmt) : stmt_(stmt) {}
+  sqlite3_stmt* stmt_;
+  bool done_ = false;
+};
+
+class TBHistory {
+ public:
+  using ScalarHandler = std::function<void(const std::string& key, int32_t day, int64_t value, bool* stop)>;
+  using DistributionHandler = std::function<void(const std::string& key, int32_t day,
+                                                 TBHistoryDistributionEnumerator& samples, bool* stop)>;
+
+  // The store at the default device path; null when it cannot be opened.
+  static std::unique_ptr<TBHistory> initWithDefaultPath(std::string* error = nullptr);
+  static std::unique_ptr<TBHistory> initWithPath(const std::string& path, std::string* error = nullptr);
+  ~TBHistory();
+
+  // Rows of days min..max (inclusive) whose key starts with prefix, ordered
+  // by day, then key. False when the store could not be read.
+  bool scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
+                           const ScalarHandler& rowHandler);
+  // One row per key and day, in the same order; the enumerator yields that
+  // key's samples in the order they were pushed and is valid only inside
+  // the handler.
+  bool distributionsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
+                                 const DistributionHandler& rowHandler);
+
+ private:
+  explicit TBHistory(sqlite3* db) : db_(db) {}
+  sqlite3* db_;
+};
+
+}  // namespace platform

@@ -1,0 +1,75 @@
+// The statistics store (Tallybook): SQLite in WAL mode at
+// $ROOT/var/mobile/Library/Tallybook/TBDataStore.sqlitedb.
+//
+// Scalars hold one signed 64-bit value per key and day; distributions hold,
+// per key and day, a list of double samples with their offset in seconds
+// within the day. Several processes write during the day; every write is one
+// immediate transaction, so none is lost.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "cf/value.h"
+
+struct sqlite3;
+
+namespace platform {
+
+inline constexpr const char* kStoreDevicePath = "/var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
+inline constexpr int kStoreSchemaVersion = 1;
+
+class TallyStore {
+ public:
+  enum class Mode { kCreate, kExisting };
+  // Null with a reason in *error when the file is not a store, is a newer
+  // schema, or cannot be opened. A file that is not a store is never written.
+  static std::unique_ptr<TallyStore> Open(const std::string& path, Mode mode, std::string* error);
+  ~TallyStore();
+
+  bool SetScalar(int32_t day, std::string_view key, int64_t value);
+  bool AddScalar(int32_t day, std::string_view key, int64_t value);
+  bool PushSample(int32_t day, std::string_view key, double value, int32_t seconds_in_day);
+  // Many samples of one key in one transaction (tools and benchmarks).
+  bool PushSamples(int32_t day, std::string_view key, const std::vector<std::pair<double, int32_t>>& samples);
+  // Many operations in one transaction; the body's writes use the methods above.
+  bool Batch(const std::function<bool()>& body);
+  bool Checkpoint();
+  const std::string& last_error() const { return last_error_; }
+  const std::string& path() const { return path_; }
+  sqlite3* handle() { return db_; }
+
+ private:
+  TallyStore(sqlite3* db, std::string path) : db_(db), path_(std::move(path)) {}
+  bool Exec(const char* sql);
+  bool EnableWriteAheadLog();
+  bool Fail(const char* what);
+  bool InTransaction(const std::function<bool()>& body);
+
+  sqlite3* db_;
+  std::string path_;
+  std::string last_error_;
+  int batch_depth_ = 0;
+};
+
+// Whole days since 1970-01-01 in the local time zone (TZ) at the instant t.
+int32_t DaysSince1970At(double t);
+// The instant at which a local day begins.
+double StartOfDay(int32_t day);
+
+}  // namespace platform
+
+// ---- the store client's calls, over the current context ----
+
+int32_t TBDaysSince1970();
+bool TBClientSetValueForScalarKey(std::string_view key, int64_t value);
+bool TBClientAddValueForScalarKey(std::string_view key, int64_t value);
+bool TBClientPushValueForDistributionKey(std::string_view key, double value, int32_t secondsInDayOffset);
+bool TBClientCheckpoint();
+// The start of a day in the store's time zone.
+cf::Date dateForDaysSince1970(int32_t day);

@@ -1,0 +1,221 @@
+#include "platform/store.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <vector>
+
+#include "../../tests/temp_dir.h"
+#include "platform/clock.h"
+#include "platform/context.h"
+#include "platform/files.h"
+#include "platform/history.h"
+#include "platform/log.h"
+
+namespace platform {
+namespace {
+
+struct Row {
+  int32_t day;
+  std::string key;
+  int64_t value;
+  bool operator==(const Row& o) const { return day == o.day && key == o.key && value == o.value; }
+};
+
+std::vector<Row> Scalars(TBHistory& h, std::string_view prefix, int32_t lo, int32_t hi) {
+  std::vector<Row> rows;
+  EXPECT_TRUE(h.scalarsForKeyPrefix(prefix, lo, hi, [&](const std::string& k, int32_t d, int64_t v, bool*) {
+    rows.push_back({d, k, v});
+  }));
+  return rows;
+}
+
+TEST(StoreTest, ConcurrentWritersLoseNothing) {
+  TempDir dir;
+  const std::string path = dir / "TBDataStore.sqlitedb";
+  constexpr int kWriters = 6, kAdds = 150;
+  std::vector<pid_t> children;
+  for (int w = 0; w < kWriters; ++w) {
+    const pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      // Each writer is its own process with its own connection, and the
+      // first ones race to create the schema.
+      std::string error;
+      auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, &error);
+      if (!store) {
+        fprintf(stderr, "open: %s\n", error.c_str());
+        _exit(10);
+      }
+      for (int i = 1; i <= kAdds; ++i) {
+        if (!store->AddScalar(100, "com.velmora.test.sum", i)) _exit(11);
+        if (i % 10 == 0 && !store->PushSample(100, "com.velmora.test.dist", w, i)) _exit(12);
+      }
+      _exit(0);
+    }
+    children.push_back(pid);
+  }
+  for (pid_t pid : children) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(WEXITSTATUS(status), 0);
+  }
+  auto history = TBHistory::initWithPath(path);
+  ASSERT_NE(history, nullptr);
+  const auto rows = Scalars(*history, "", 100, 100);
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0].value, int64_t{kWriters} * kAdds * (kAdds + 1) / 2);
+  size_t samples = 0;
+  history->distributionsForKeyPrefix("", 100, 100, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
+    while (e.getNextValue(nullptr, nullptr)) ++samples;
+  });
+  EXPECT_EQ(samples, size_t{kWriters} * kAdds / 10);
+}
+
+TEST(StoreTest, HistoryStreamsInDayKeyOrderWithPrefixAndRange) {
+  TempDir dir;
+  const std::string path = dir / "s.sqlitedb";
+  auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+  ASSERT_NE(store, nullptr);
+  ASSERT_TRUE(store->SetScalar(11, "b.two", 2));
+  ASSERT_TRUE(store->SetScalar(10, "b.one", 1));
+  ASSERT_TRUE(store->SetScalar(11, "a.x", -5));
+  ASSERT_TRUE(store->SetScalar(12, "a.y", 9));
+  ASSERT_TRUE(store->SetScalar(11, "b.two", 20));  // set replaces
+  ASSERT_TRUE(store->AddScalar(11, "b.three", 3));
+  ASSERT_TRUE(store->AddScalar(11, "b.three", -4));  // add adds
+  ASSERT_TRUE(store->SetScalar(11, "b", 7));          // the prefix itself matches
+  ASSERT_TRUE(store->SetScalar(11, "c_", 8));         // LIKE wildcards mean nothing
+  ASSERT_TRUE(store->SetScalar(11, "cX", 9));
+
+  auto history = TBHistory::initWithPath(path);
+  ASSERT_NE(history, nullptr);
+  EXPECT_EQ(Scalars(*history, "", 10, 11),
+            (std::vector<Row>{{10, "b.one", 1}, {11, "a.x", -5}, {11, "b", 7}, {11, "b.three", -1},
+                              {11, "b.two", 20}, {11, "cX", 9}, {11, "c_", 8}}));
+  EXPECT_EQ(Scalars(*history, "b", 11, 12), (std::vector<Row>{{11, "b", 7}, {11, "b.three", -1}, {11, "b.two", 20}}));
+  EXPECT_EQ(Scalars(*history, "c_", 0, 100), (std::vector<Row>{{11, "c_", 8}}));
+  EXPECT_TRUE(Scalars(*history, "", 13, 20).empty());
+  EXPECT_TRUE(Scalars(*history, "", 12, 11).empty());
+
+  int seen = 0;
+  history->scalarsForKeyPrefix("", 0, 100, [&](const std::string&, int32_t, int64_t, bool* stop) {
+    if (++seen == 2) *stop = true;
+  });
+  EXPECT_EQ(seen, 2);
+
+  // Samples come back in push order with their offsets, one row per key and day.
+  ASSERT_TRUE(store->PushSample(11, "d.lat", 3.5, 100));
+  ASSERT_TRUE(store->PushSamples(11, "d.lat", {{-1.25, 7}, {1e300, 86399}}));
+  ASSERT_TRUE(store->PushSample(10, "d.lat", 42, 0));
+  ASSERT_TRUE(store->PushSample(11, "d.a", 0, 5));
+  std::vector<std::string> order;
+  std::vector<std::pair<double, int32_t>> lat11;
+  ASSERT_TRUE(history->distributionsForKeyPrefix(
+      "d.", 10, 11, [&](const std::string& key, int32_t day, TBHistoryDistributionEnumerator& e, bool*) {
+        order.push_back(std::to_string(day) + " " + key);
+        double v;
+        int32_t off;
+        while (e.getNextValue(&v, &off))
+          if (day == 11 && key == "d.lat") lat11.emplace_back(v, off);
+        EXPECT_FALSE(e.getNextValue(&v, &off));  // stays exhausted
+      }));
+  EXPECT_EQ(order, (std::vector<std::string>{"10 d.lat", "11 d.a", "11 d.lat"}));
+  EXPECT_EQ(lat11, (std::vector<std::pair<double, int32_t>>{{3.5, 100}, {-1.25, 7}, {1e300, 86399}}));
+  EXPECT_TRUE(store->Checkpoint());
+}
+
+TEST(StoreTest, AHistoryCallSeesOneConsistentView) {
+  TempDir dir;
+  const std::string path = dir / "s.sqlitedb";
+  auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+  ASSERT_TRUE(store->PushSamples(5, "k", {{1, 0}, {2, 0}}));
+  ASSERT_TRUE(store->SetScalar(5, "s", 1));
+  auto history = TBHistory::initWithPath(path);
+  int count = 0;
+  ASSERT_TRUE(history->distributionsForKeyPrefix("", 5, 5, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
+    // A writer commits while the reader is half-way: the reader keeps its view.
+    ASSERT_TRUE(e.getNextValue(nullptr, nullptr));
+    ++count;
+    auto writer = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+    ASSERT_TRUE(writer->PushSamples(5, "k", {{3, 0}, {4, 0}}));
+    ASSERT_TRUE(writer->PushSample(5, "later", 1, 0));
+    while (e.getNextValue(nullptr, nullptr)) ++count;
+  }));
+  EXPECT_EQ(count, 2);
+  // The next call sees the new rows.
+  int keys = 0;
+  history->distributionsForKeyPrefix("", 5, 5, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++keys; });
+  EXPECT_EQ(keys, 2);
+}
+
+TEST(StoreTest, ForeignFilesAreRefusedAndLeftUntouched) {
+  TempDir dir;
+  const std::string text = dir / "text.sqlitedb";
+  const std::string content(5000, 'x');
+  ASSERT_TRUE(WriteFileAtomically(text, content));
+  std::string error;
+  EXPECT_EQ(TallyStore::Open(text, TallyStore::Mode::kCreate, &error), nullptr);
+  EXPECT_NE(error.find("is not a Tallybook store"), std::string::npos) << error;
+  EXPECT_EQ(*ReadFile(text), content);
+  EXPECT_EQ(TBHistory::initWithPath(text, &error), nullptr);
+  EXPECT_EQ(*ReadFile(text), content);
+
+  // Another program's SQLite database.
+  const std::string other = dir / "other.sqlitedb";
+  {
+    sqlite3* db = nullptr;
+    sqlite3_open(other.c_str(), &db);
+    sqlite3_exec(db, "CREATE TABLE notes(x)", nullptr, nullptr, nullptr);
+    sqlite3_close(db);
+  }
+  EXPECT_EQ(TallyStore::Open(other, TallyStore::Mode::kCreate, &error), nullptr);
+  EXPECT_EQ(error, other + " is an SQLite database but not a Tallybook store");
+
+  // A store written by a newer program.
+  const std::string newer = dir / "newer.sqlitedb";
+  ASSERT_NE(TallyStore::Open(newer, TallyStore::Mode::kCreate, nullptr), nullptr);
+  {
+    sqlite3* db = nullptr;
+    sqlite3_open(newer.c_str(), &db);
+    sqlite3_exec(db, "PRAGMA user_version=7", nullptr, nullptr, nullptr);
+    sqlite3_close(db);
+  }
+  EXPECT_EQ(TallyStore::Open(newer, TallyStore::Mode::kCreate, &error), nullptr);
+  EXPECT_EQ(error, newer + " has store schema version 7, newer than this program understands (1)");
+
+  EXPECT_EQ(TBHistory::initWithPath(dir / "missing.sqlitedb", &error), nullptr);
+  EXPECT_FALSE(FileExists(dir / "missing.sqlitedb"));
+}
+
+TEST(StoreTest, ClientCallsWriteTodayUnderTheRoot) {
+  TempDir root;
+  auto clock = std::make_shared<FixedClock>(86400.0 * 20000 + 3600);
+  auto log = std::make_shared<CaptureLog>();
+  setenv("TZ", "UTC0", 1);
+  tzset();
+  ContextScope scope(root.path(), Backends{clock, log});
+  ASSERT_TRUE(TBClientSetValueForScalarKey("com.velmora.x", 5));
+  ASSERT_TRUE(TBClientAddValueForScalarKey("com.velmora.x", 6));
+  ASSERT_TRUE(TBClientPushValueForDistributionKey("com.velmora.d", 0.5, 3600));
+  ASSERT_TRUE(TBClientCheckpoint());
+  auto history = TBHistory::initWithDefaultPath();
+  ASSERT_NE(history, nullptr);
+  EXPECT_EQ(Scalars(*history, "", 20000, 20000), (std::vector<Row>{{20000, "com.velmora.x", 11}}));
+  EXPECT_TRUE(FileExists(root / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb"));
+
+  // A broken store: the client answers false with one error line, and never writes.
+  TempDir bad;
+  ASSERT_TRUE(WriteFileAtomically(bad / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb", "garbage"));
+  ContextScope broken(bad.path(), Backends{clock, log});
+  EXPECT_FALSE(TBClientSetValueForScalarKey("k", 1));
+  EXPECT_FALSE(TBClientCheckpoint());
+  EXPECT_EQ(log->CountContaining("Tallybook store unavailable"), 1u);
+  EXPECT_EQ(*ReadFile(bad / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb"), "garbage");
+}
+
+}  // namespace
+}  // namespace platform

@@ -1,0 +1,103 @@
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "../temp_dir.h"
+#include "platform/files.h"
+#include "run.h"
+
+namespace {
+
+const std::string kStore = "var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
+
+class TallybookTest : public ::testing::Test {
+ protected:
+  TempDir root;
+  // 2026-11-22 10:00 UTC is day 20779.
+  std::map<std::string, std::string> env{
+      {"TALLYRUN_ROOT", root.path()}, {"TALLYRUN_NOW", "2026-11-22T10:00:00Z"}, {"TZ", "UTC0"}};
+
+  RunResult Tallybook(const std::vector<std::string>& args) { return RunProgram(TALLYBOOK_BIN, args, env); }
+};
+
+TEST_F(TallybookTest, WritesAndDumpsToday) {
+  EXPECT_EQ(Tallybook({"today"}).out, "20779\n");
+  EXPECT_EQ(Tallybook({"set", "com.velmora.a", "-9223372036854775808"}).status, 0);
+  EXPECT_EQ(Tallybook({"add", "com.velmora.b", "5"}).status, 0);
+  EXPECT_EQ(Tallybook({"add", "com.velmora.b", "-2"}).status, 0);
+  EXPECT_EQ(Tallybook({"push", "com.velmora.lat", "1.5", "--offset", "60"}).status, 0);
+  EXPECT_EQ(Tallybook({"push", "com.velmora.lat", "2.5"}).status, 0);  // offset from the clock
+  EXPECT_EQ(Tallybook({"push", "other.lat", "-1"}).status, 0);
+  env["TALLYRUN_NOW"] = "2026-11-23T00:00:00Z";
+  EXPECT_EQ(Tallybook({"set", "com.velmora.a", "1"}).status, 0);
+
+  const RunResult all = Tallybook({"dump"});
+  EXPECT_EQ(all.status, 0) << all.err;
+  EXPECT_EQ(all.out,
+            "20779 com.velmora.a -9223372036854775808\n"
+            "20779 com.velmora.b 3\n"
+            "20780 com.velmora.a 1\n"
+            "20779 com.velmora.lat 2 1.5 2.5 2\n"
+            "20779 other.lat 1 -1 -1 -1\n");
+  EXPECT_EQ(Tallybook({"dump", "--day", "20779", "--prefix", "com.velmora.l"}).out, "20779 com.velmora.lat 2 1.5 2.5 2\n");
+  EXPECT_EQ(Tallybook({"dump", "--day", "20780"}).out, "20780 com.velmora.a 1\n");
+}
+
+TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
+  const std::vector<std::vector<std::string>> bad = {
+      {"set", "", "1"},
+      {"set", "k", "1.5"},
+      {"set", "k", "9223372036854775808"},
+      {"add", "k", "twelve"},
+      {"add", "k", ""},
+      {"push", "k", "nan"},
+      {"push", "k", "1e999"},
+      {"push", "k", "1", "--offset", "-1"},
+      {"push", "k", "1", "--offset", "abc"},
+      {"frobnicate"},
+      {},
+      {"set", "k"},
+      {"dump", "--day", "99999999999"},
+  };
+  for (const auto& args : bad) {
+    const RunResult r = Tallybook(args);
+    std::string joined;
+    for (const auto& a : args) joined += a + " ";
+    EXPECT_EQ(r.status, 2) << joined;
+    EXPECT_FALSE(r.err.empty()) << joined;
+    EXPECT_FALSE(platform::FileExists(root / kStore)) << joined;
+  }
+  EXPECT_EQ(Tallybook({"set", "k", "x"}).err, "tallybook: value is not a signed 64-bit integer: \"x\"\n");
+  EXPECT_EQ(Tallybook({"add", "", "1"}).err, "tallybook: key must not be empty\n");
+
+  // A file that is not a store: clear message, status 1, file untouched.
+  ASSERT_TRUE(platform::WriteFileAtomically(root / kStore, "plain text, not a database"));
+  const RunResult r = Tallybook({"add", "k", "1"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_NE(r.err.find("is not a Tallybook store"), std::string::npos) << r.err;
+  EXPECT_EQ(*platform::ReadFile(root / kStore), "plain text, not a database");
+  EXPECT_EQ(Tallybook({"dump"}).status, 1);
+}
+
+TEST_F(TallybookTest, ParallelProcessesAddExactly) {
+  constexpr int kProcesses = 4, kEach = 15;
+  std::vector<pid_t> pids;
+  for (int p = 0; p < kProcesses; ++p) {
+    const pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      for (int i = 0; i < kEach; ++i)
+        if (RunProgram(TALLYBOOK_BIN, {"add", "com.velmora.hits", "3"}, env).status != 0) _exit(1);
+      _exit(0);
+    }
+    pids.push_back(pid);
+  }
+  for (pid_t pid : pids) {
+    int status = 0;
+    waitpid(pid, &status, 0);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
+  EXPECT_EQ(Tallybook({"dump"}).out, "20779 com.velmora.hits " + std::to_string(kProcesses * kEach * 3) + "\n");
+}
+
+}  // namespace
