@@ -1,16 +1,22 @@
 #!/usr/bin/env bash
-# Builds and runs the main job on the default device root (build/default-root).
+# Builds, creates the default device root if it does not exist, runs the
+# daily job for yesterday on it and prints the aggregated log it wrote.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/deps.sh
 cmake -S . -B build -G Ninja
 cmake --build build
 export TALLYRUN_ROOT="${TALLYRUN_ROOT:-$PWD/build/default-root}"
-tb=build/src/tools/tallybook
-# Until the daily job lands, exercise the store the job reads: record a
-# counter and two samples for today and print what the store holds.
-"$tb" add com.velmora.example.launches 1
-"$tb" push com.velmora.example.latency 12.5
-"$tb" push com.velmora.example.latency 7.25
-echo "store of $TALLYRUN_ROOT, today is day $("$tb" today):"
-"$tb" dump
+if [ ! -d "$TALLYRUN_ROOT" ]; then
+  build/src/tools/devsim init "$TALLYRUN_ROOT" >/dev/null
+fi
+submissions="$TALLYRUN_ROOT/var/diagvault/submissions"
+before=$(ls "$submissions" 2>/dev/null | grep -c '^log-aggregated_.*\.193$' || true)
+TALLYRUN_LOG_STDERR=1 build/src/driver/tallyrun -f
+newest=$(ls -t "$submissions"/log-aggregated_*.193 2>/dev/null | head -n 1 || true)
+after=$(ls "$submissions" 2>/dev/null | grep -c '^log-aggregated_.*\.193$' || true)
+if [ -n "$newest" ] && [ "$after" -gt "$before" ]; then
+  echo "aggregated log: $newest"
+else
+  echo "no aggregated log was written (nothing whitelisted for yesterday, or submission is off)"
+fi

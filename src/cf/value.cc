@@ -7,6 +7,7 @@
 #include <ctime>
 #include <functional>
 #include <limits>
+#include <ostream>
 
 namespace cf {
 
@@ -257,9 +258,10 @@ const Value* Dictionary::Find(const Value& key) const {
   const long i = impl_->FindIndex(key);
   return i < 0 ? nullptr : &impl_->entries[static_cast<size_t>(i)].second;
 }
-Value Dictionary::Get(const Value& key) const {
+const Value& Dictionary::Get(const Value& key) const {
+  static const Value kNull;
   const Value* v = Find(key);
-  return v ? *v : Value();
+  return v ? *v : kNull;
 }
 void Dictionary::Set(Value key, Value value) {
   const long i = impl_->FindIndex(key);
@@ -314,6 +316,11 @@ const char* TypeName(Type t) {
     case Type::kDictionary: return "dictionary";
   }
   return "?";
+}
+
+std::string TypeNameWithArticle(Type t) {
+  const std::string name = TypeName(t);
+  return (t == Type::kArray ? "an " : "a ") + name;
 }
 
 const Data* Value::AsData() const {
@@ -466,6 +473,8 @@ std::string Value::Description() const {
   Describe(*this, 0, false, out);
   return out;
 }
+
+void PrintTo(const Value& v, std::ostream* os) { *os << v.Description(); }
 
 Value Value::MutableCopy() const {
   if (auto a = AsArray()) return a->MutableCopy();

@@ -9,6 +9,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <iosfwd>
 #include <memory>
 #include <optional>
 #include <string>
@@ -125,7 +126,8 @@ class Dictionary {
   bool empty() const { return size() == 0; }
   // Borrowed: null when absent.
   const Value* Find(const Value& key) const;
-  Value Get(const Value& key) const;  // null Value when absent
+  // A null Value when absent. The reference stays valid until the dictionary changes.
+  const Value& Get(const Value& key) const;
   bool Contains(const Value& key) const { return Find(key) != nullptr; }
   void Set(Value key, Value value);
   // Set without looking for an existing key; for builders that know the key
@@ -150,6 +152,8 @@ using Data = std::vector<uint8_t>;
 enum class Type { kNull, kBoolean, kNumber, kString, kData, kDate, kArray, kDictionary };
 
 const char* TypeName(Type t);
+// "a number", "an array": for messages.
+std::string TypeNameWithArticle(Type t);
 
 class Value {
  public:
@@ -211,6 +215,9 @@ class Value {
 struct ValueHash {
   size_t operator()(const Value& v) const { return v.Hash(); }
 };
+
+// For test failure messages.
+void PrintTo(const Value& v, std::ostream* os);
 
 // Text of a date as the system prints it: "2026-11-22 10:00:00 +0000".
 std::string DateDescription(const Date& d);

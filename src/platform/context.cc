@@ -13,6 +13,11 @@ namespace {
 
 Context* g_current = nullptr;
 
+uint64_t NextId() {
+  static uint64_t next = 0;
+  return ++next;
+}
+
 Context& DefaultContext() {
   // Built once from the environment and never destroyed, so services stay
   // usable from exit handlers.
@@ -35,7 +40,8 @@ std::string EnvOr(const char* name, const char* fallback) {
 
 Context& Context::Current() { return g_current ? *g_current : DefaultContext(); }
 
-Context::Context(std::string root, Backends backends) : root_(std::move(root)), backends_(std::move(backends)) {
+Context::Context(std::string root, Backends backends)
+    : root_(std::move(root)), id_(NextId()), backends_(std::move(backends)) {
   while (root_.size() > 1 && root_.back() == '/') root_.pop_back();
   if (!backends_.clock) backends_.clock = std::make_shared<SystemClock>();
   if (!backends_.log) backends_.log = std::make_shared<SyslogSink>();

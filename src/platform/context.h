@@ -3,6 +3,7 @@
 // tests install their own with a ContextScope.
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -31,6 +32,8 @@ class Context {
   Context& operator=(const Context&) = delete;
 
   const std::string& root() const { return root_; }
+  // Unique for the life of the process, for caches that belong to one context.
+  uint64_t id() const { return id_; }
   // Resolves a device path such as "/var/run/x.sock" under the root.
   std::string Path(std::string_view device_path) const;
 
@@ -44,6 +47,7 @@ class Context {
  private:
   friend class ContextScope;
   std::string root_;
+  uint64_t id_;
   Backends backends_;
   std::unique_ptr<Preferences> preferences_;
   std::unique_ptr<TallyStore> store_;

@@ -56,7 +56,7 @@ Preferences::Domain* Preferences::Load(std::string_view domain) {
   } else if (!d.bad_file_reported) {
     // Read as empty; the file is left as it is until a later write.
     LogError("Preferences file %s is not a property-list dictionary (%s); reading it as empty", path,
-             parsed.ok() ? std::string("root is a ") + cf::TypeName(parsed.value.type()) : parsed.error);
+             parsed.ok() ? "root is " + cf::TypeNameWithArticle(parsed.value.type()) : parsed.error);
     d.bad_file_reported = true;
   }
   return &d;

@@ -121,7 +121,7 @@ TEST_F(PrefsTest, BadFileReadsEmptyWithOneErrorAndIsOnlyReplacedByAWrite) {
   const std::string array_file = root / "Library/Preferences/com.velmora.da.plist";
   ASSERT_TRUE(WriteFileAtomically(array_file, "<plist version=\"1.0\"><array/></plist>"));
   EXPECT_TRUE(DGVPreferencesGetValue("g", "com.velmora.da").IsNull());
-  EXPECT_EQ(log->CountContaining("(root is a array)"), 1u);
+  EXPECT_EQ(log->CountContaining("(root is an array)"), 1u);
 
   DGVPreferencesSetValue("a", cf::Value::SInt32(1), kDomain);
   ASSERT_TRUE(DGVPreferencesSynchronize(kDomain));

@@ -1,0 +1,71 @@
+#include "driver/driver.h"
+#include "platform/diagnostics.h"
+#include "platform/log.h"
+
+using platform::LogDefault;
+using platform::LogError;
+using platform::XPCEvent;
+
+bool gAppInfoRequested = false;
+
+namespace {
+// The single turn of the first message that is not an app-data message.
+bool gServiceTurnTaken = false;
+}  // namespace
+
+void HandleServiceConnection(const XPCEvent& event) {
+  if (event.type != XPCEvent::Type::kConnection) return;
+  xpc_connection_set_target_queue(event.connection);
+  xpc_connection_set_event_handler(event.connection, HandleServiceMessage);
+  xpc_connection_resume(event.connection);
+}
+
+cf::Value AppInfoEntryFromRecord(const cf::Value& record) {
+  const std::string* bundle = xpc_dictionary_get_string(record, "bundle_id");
+  const std::string* version = xpc_dictionary_get_string(record, "version");
+  const auto uuid = xpc_dictionary_get_uuid(record, "uuid");
+  if (!bundle || !version || !uuid) return {};
+  cf::Dictionary entry;
+  entry.Set("bundle", *bundle);
+  entry.Set("version", *version);
+  entry.Set("adamID", cf::Value::SInt64(xpc_dictionary_get_int64(record, "adam_id")));
+  entry.Set("arch", cf::Value::SInt64(xpc_dictionary_get_int64(record, "arch")));
+  entry.Set("uuid", uuid_unparse(*uuid));
+  return entry;
+}
+
+void HandleServiceMessage(const XPCEvent& event) {
+  if (event.type != XPCEvent::Type::kDictionary) return;
+  const int32_t operation = static_cast<int32_t>(xpc_dictionary_get_int64(event.message, "operation"));
+  if (operation == kOperationAppData) {
+    cf::Array list;
+    const cf::Value app_data = xpc_dictionary_get_value(event.message, "app_data");
+    // A missing array counts as an empty list; incomplete records are skipped.
+    if (const cf::Array* records = app_data.AsArray()) {
+      for (const cf::Value& record : *records) {
+        cf::Value entry = AppInfoEntryFromRecord(record);
+        if (entry.IsNull()) {
+          LogError("Skipping an app record without bundle_id, version or uuid");
+          continue;
+        }
+        list.Append(entry);
+      }
+    }
+    LogDefault("tallyrun got %sAAI:\n%@", gAppInfoRequested ? "requested" : "(unsolicited -- so ignoring) ",
+               cf::Value(list));
+    if (gAppInfoRequested) {
+      RunDailyTasksIfDayChanged(list);
+      gAppInfoRequested = false;
+    }
+    return;
+  }
+  if (gServiceTurnTaken) return;
+  gServiceTurnTaken = true;
+  if (operation == kOperationRunDay) {
+    RunDailyTasks(static_cast<int32_t>(xpc_dictionary_get_int64(event.message, "value")), cf::Value());
+  } else if (operation == kOperationLoggingStatus) {
+    gAppInfoRequested = true;
+    notify_post(kLoggingNotification);
+    LogDefault("notified of logging status, waiting for activate app info");
+  }
+}

@@ -1,0 +1,53 @@
+// Diagnostics and crash-report support services: log submission, the OS
+// version, the device's answers, structured-data log housekeeping and the
+// service-and-repair log roll.
+#pragma once
+
+#include <functional>
+#include <string>
+#include <string_view>
+
+#include "cf/value.h"
+
+namespace platform {
+
+// What a submission writer writes into.
+class LogOutput {
+ public:
+  virtual ~LogOutput() = default;
+  virtual bool Write(std::string_view bytes) = 0;
+};
+
+inline constexpr const char* kSubmissionsDir = "/var/diagvault/submissions";
+
+}  // namespace platform
+
+// One file per log in $ROOT/var/diagvault/submissions/, named
+// <name>_<YYYY-MM-DD-HHMMSS>.<type> (local time; "-N" before the dot when the
+// name is taken), holding exactly the writer's bytes, with <file>.json beside
+// it. False, and nothing left behind, when it cannot be written.
+bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, const cf::Value& options,
+                              const cf::Value& reserved, const std::function<void(platform::LogOutput&)>& writer);
+
+// "<ProductVersion> (<ProductBuildVersion>)" from $ROOT/device/system-version.plist,
+// else from /etc/os-release.
+std::string DGVOSVersion();
+
+// From $ROOT/device/answers.plist: "DiagnosticLogSubmissionEnabled" (default true).
+bool DiagnosticLogSubmissionEnabled();
+// A boolean answer of $ROOT/device/answers.plist; false when absent.
+bool DVGetBoolAnswer(std::string_view question);
+// Any answer of $ROOT/device/answers.plist; null when absent.
+cf::Value DVCopyAnswer(std::string_view question);
+
+// Moves structured-data log files last written before today from
+// $ROOT/var/faultkeep/ into $ROOT/var/faultkeep/old/. Never fails the caller.
+void FKDumpAllOldStructuredDataLogs();
+// Keeps the newest 7 files of $ROOT/var/halvern/ and removes the rest.
+void rollHalvernLogs();
+
+// Appends "<ISO-8601 time> <name>" to $ROOT/var/run/notifications.log.
+void notify_post(std::string_view name);
+
+// MD5 of the bytes, as 16 raw bytes.
+std::string CC_MD5(std::string_view bytes);

@@ -1,0 +1,329 @@
+#include "platform/service.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <thread>
+#include <vector>
+
+#include "cf/plist.h"
+#include "platform/context.h"
+#include "platform/files.h"
+#include "platform/log.h"
+
+namespace platform {
+
+class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
+ public:
+  XPCConnection(int fd, bool listener, std::string path) : fd_(fd), listener_(listener), path_(std::move(path)) {}
+  ~XPCConnection() { Close(); }
+
+  void Close();
+  // Handles readiness; true when an event reached a handler.
+  bool OnReady();
+
+  int fd_;
+  bool listener_;
+  bool resumed_ = false;
+  std::string path_;  // the socket file of a listener, removed on close
+  xpc_handler_t handler_;
+  std::string buffer_;
+};
+
+namespace {
+
+// Connections the run loop watches, in the order they were resumed.
+std::vector<xpc_connection_t>& Watched() {
+  static std::vector<xpc_connection_t> watched;
+  return watched;
+}
+
+void Unwatch(const XPCConnection* c) {
+  auto& w = Watched();
+  for (auto it = w.begin(); it != w.end(); ++it)
+    if (it->get() == c) {
+      w.erase(it);
+      return;
+    }
+}
+
+void Deliver(const xpc_handler_t& handler, XPCEvent event) {
+  if (handler) handler(event);
+}
+
+uint32_t BigEndian32(const char* p) {
+  const auto* u = reinterpret_cast<const unsigned char*>(p);
+  return (uint32_t{u[0]} << 24) | (uint32_t{u[1]} << 16) | (uint32_t{u[2]} << 8) | u[3];
+}
+
+}  // namespace
+
+void XPCConnection::Close() {
+  if (fd_ < 0) return;
+  close(fd_);
+  fd_ = -1;
+  if (listener_ && !path_.empty()) unlink(path_.c_str());
+}
+
+bool XPCConnection::OnReady() {
+  auto self = shared_from_this();  // a handler may cancel us
+  if (listener_) {
+    const int peer = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+    if (peer < 0) return false;
+    Deliver(handler_, {XPCEvent::Type::kConnection, std::make_shared<XPCConnection>(peer, false, ""), {}});
+    return true;
+  }
+  char chunk[65536];
+  const ssize_t n = read(fd_, chunk, sizeof chunk);
+  if (n < 0) {
+    if (errno == EINTR || errno == EAGAIN) return false;
+  }
+  if (n <= 0) {
+    if (!buffer_.empty()) LogError("Service peer closed the connection in the middle of a message");
+    Close();
+    Unwatch(this);
+    Deliver(handler_, {XPCEvent::Type::kError, nullptr, {}});
+    return true;
+  }
+  buffer_.append(chunk, static_cast<size_t>(n));
+  bool delivered = false;
+  // Hand over every complete frame; a bad one ends this connection.
+  while (fd_ >= 0 && buffer_.size() >= 4) {
+    const uint32_t length = BigEndian32(buffer_.data());
+    if (length > kMaxServiceFrame) {
+      LogError("Service message of %u bytes is over the limit of %u; closing the connection", length,
+               static_cast<uint32_t>(kMaxServiceFrame));
+      Close();
+      Unwatch(this);
+      return delivered;
+    }
+    if (buffer_.size() < 4 + size_t{length}) break;
+    std::string error;
+    cf::Value message = DecodeServiceMessage(std::string_view(buffer_).substr(4, length), &error);
+    buffer_.erase(0, 4 + size_t{length});
+    if (message.IsNull()) {
+      LogError("Bad service message (%s); closing the connection", error);
+      Close();
+      Unwatch(this);
+      return delivered;
+    }
+    Deliver(handler_, {XPCEvent::Type::kDictionary, nullptr, std::move(message)});
+    delivered = true;
+  }
+  return delivered;
+}
+
+std::string ServiceSocketPath(std::string_view service_name) {
+  return Context::Current().Path("/var/run/" + std::string(service_name) + ".sock");
+}
+
+bool EncodeServiceFrame(const cf::Value& message, std::string* frame, std::string* error) {
+  std::string body;
+  if (!cf::WriteBinaryPropertyList(message, body, error)) return false;
+  if (body.size() > kMaxServiceFrame) {
+    if (error) *error = "message is larger than 1 MiB";
+    return false;
+  }
+  const uint32_t n = static_cast<uint32_t>(body.size());
+  frame->assign({static_cast<char>(n >> 24), static_cast<char>(n >> 16), static_cast<char>(n >> 8), static_cast<char>(n)});
+  frame->append(body);
+  return true;
+}
+
+cf::Value DecodeServiceMessage(std::string_view body, std::string* error) {
+  cf::ParseResult parsed = cf::ParsePropertyList(body);
+  if (!parsed.ok()) {
+    if (error) *error = parsed.error;
+    return {};
+  }
+  if (!parsed.value.AsDictionary()) {
+    if (error) *error = cf::TypeNameWithArticle(parsed.value.type()) + ", not a dictionary";
+    return {};
+  }
+  return parsed.value;
+}
+
+bool SendServiceMessage(std::string_view service_name, const cf::Value& message, std::string* error) {
+  const std::string path = ServiceSocketPath(service_name);
+  std::string frame;
+  if (!EncodeServiceFrame(message, &frame, error)) return false;
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  if (path.size() >= sizeof addr.sun_path) {
+    if (error) *error = "socket path too long: " + path;
+    return false;
+  }
+  std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0 || connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    if (error) *error = "no service listening at " + path + " (" + std::strerror(errno) + ")";
+    if (fd >= 0) close(fd);
+    return false;
+  }
+  size_t done = 0;
+  while (done < frame.size()) {
+    const ssize_t n = send(fd, frame.data() + done, frame.size() - done, MSG_NOSIGNAL);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      if (error) *error = std::string("cannot send: ") + std::strerror(errno);
+      close(fd);
+      return false;
+    }
+    done += static_cast<size_t>(n);
+  }
+  close(fd);
+  return true;
+}
+
+}  // namespace platform
+
+using namespace platform;
+
+xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint64_t flags) {
+  if (!(flags & XPC_CONNECTION_MACH_SERVICE_LISTENER)) {
+    LogError("Only listeners can be created for %s", std::string(name));
+    return nullptr;
+  }
+  const std::string path = ServiceSocketPath(name);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  if (path.size() >= sizeof addr.sun_path) {
+    LogError("Service socket path too long: %s", path);
+    return nullptr;
+  }
+  std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  const size_t slash = path.find_last_of('/');
+  if (!MakeDirectories(path.substr(0, slash))) {
+    LogError("Cannot create the directory of %s: %s", path, std::strerror(errno));
+    return nullptr;
+  }
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  if (fd < 0) {
+    LogError("Cannot create the service socket: %s", std::strerror(errno));
+    return nullptr;
+  }
+  unlink(path.c_str());  // a socket left by an earlier run
+  // Bind under a strict umask so the socket is 0600 from its first moment.
+  const mode_t old_mask = umask(0177);
+  const int bound = bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+  umask(old_mask);
+  if (bound != 0 || listen(fd, 16) != 0) {
+    LogError("Cannot listen on %s: %s", path, std::strerror(errno));
+    close(fd);
+    return nullptr;
+  }
+  return std::make_shared<XPCConnection>(fd, true, path);
+}
+
+void xpc_connection_set_event_handler(const xpc_connection_t& connection, xpc_handler_t handler) {
+  if (connection) connection->handler_ = std::move(handler);
+}
+
+void xpc_connection_set_target_queue(const xpc_connection_t&) {}
+
+void xpc_connection_resume(const xpc_connection_t& connection) {
+  if (!connection || connection->resumed_ || connection->fd_ < 0) return;
+  connection->resumed_ = true;
+  Watched().push_back(connection);
+}
+
+void xpc_connection_cancel(const xpc_connection_t& connection) {
+  if (!connection) return;
+  connection->Close();
+  Unwatch(connection.get());
+}
+
+int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled) {
+  using Clock = std::chrono::steady_clock;
+  const auto deadline = Clock::now() + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
+  for (;;) {
+    const auto now = Clock::now();
+    if (now >= deadline) return kCFRunLoopRunTimedOut;
+    const int wait_ms = static_cast<int>(std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now).count()) + 1;
+    std::vector<xpc_connection_t> sources = Watched();
+    if (sources.empty()) {
+      // The main queue is always a source of the main run loop, so an empty
+      // loop still waits out its time rather than finishing at once.
+      std::this_thread::sleep_for(deadline - now);
+      return kCFRunLoopRunTimedOut;
+    }
+    std::vector<pollfd> fds;
+    for (const auto& c : sources) fds.push_back({c->fd_, POLLIN, 0});
+    const int ready = poll(fds.data(), fds.size(), wait_ms);
+    if (ready < 0 && errno != EINTR) return kCFRunLoopRunStopped;
+    bool handled = false;
+    for (size_t i = 0; ready > 0 && i < fds.size(); ++i)
+      if (fds[i].revents && sources[i]->fd_ >= 0) handled |= sources[i]->OnReady();
+    if (handled && returnAfterSourceHandled) return kCFRunLoopRunHandledSource;
+  }
+}
+
+int64_t xpc_dictionary_get_int64(const cf::Value& message, std::string_view key) {
+  const cf::Dictionary* d = message.AsDictionary();
+  if (!d) return 0;
+  const cf::Value* v = d->Find(std::string(key));
+  if (!v || !v->AsNumber()) return 0;
+  return v->AsNumber()->AsSInt64();
+}
+
+const std::string* xpc_dictionary_get_string(const cf::Value& message, std::string_view key) {
+  const cf::Dictionary* d = message.AsDictionary();
+  if (!d) return nullptr;
+  const cf::Value* v = d->Find(std::string(key));
+  return v ? v->AsString() : nullptr;
+}
+
+std::optional<std::array<uint8_t, 16>> xpc_dictionary_get_uuid(const cf::Value& message, std::string_view key) {
+  const cf::Dictionary* d = message.AsDictionary();
+  if (!d) return std::nullopt;
+  const cf::Value* v = d->Find(std::string(key));
+  if (!v || !v->AsData() || v->AsData()->size() != 16) return std::nullopt;
+  std::array<uint8_t, 16> out;
+  std::memcpy(out.data(), v->AsData()->data(), 16);
+  return out;
+}
+
+cf::Value xpc_dictionary_get_value(const cf::Value& message, std::string_view key) {
+  const cf::Dictionary* d = message.AsDictionary();
+  return d ? d->Get(std::string(key)) : cf::Value();
+}
+
+std::string uuid_unparse(const std::array<uint8_t, 16>& uuid) {
+  static const char* kHex = "0123456789ABCDEF";
+  std::string out;
+  for (size_t i = 0; i < 16; ++i) {
+    if (i == 4 || i == 6 || i == 8 || i == 10) out += '-';
+    out += kHex[uuid[i] >> 4];
+    out += kHex[uuid[i] & 15];
+  }
+  return out;
+}
+
+std::optional<std::array<uint8_t, 16>> uuid_parse(std::string_view text) {
+  if (text.size() != 36) return std::nullopt;
+  std::array<uint8_t, 16> out{};
+  size_t byte = 0;
+  for (size_t i = 0; i < 36;) {
+    if (i == 8 || i == 13 || i == 18 || i == 23) {
+      if (text[i] != '-') return std::nullopt;
+      ++i;
+      continue;
+    }
+    int v = 0;
+    for (int k = 0; k < 2; ++k, ++i) {
+      const char c = text[i];
+      const int d = c >= '0' && c <= '9' ? c - '0' : c >= 'a' && c <= 'f' ? c - 'a' + 10 : c >= 'A' && c <= 'F' ? c - 'A' + 10 : -1;
+      if (d < 0) return std::nullopt;
+      v = v * 16 + d;
+    }
+    out[byte++] = static_cast<uint8_t>(v);
+  }
+  return out;
+}

@@ -1,0 +1,72 @@
+// The on-demand service: a listener on the Unix socket
+// $ROOT/var/run/<service>.sock (mode 0600) and a run loop on the main thread.
+//
+// Messages travel as a 4-byte big-endian length and a binary property-list
+// dictionary. Handlers run only inside CFRunLoopRunInMode, one at a time.
+#pragma once
+
+#include <array>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "cf/value.h"
+
+namespace platform {
+
+class XPCConnection;
+using xpc_connection_t = std::shared_ptr<XPCConnection>;
+
+struct XPCEvent {
+  enum class Type { kConnection, kDictionary, kError };
+  Type type;
+  xpc_connection_t connection;  // kConnection: the new peer
+  cf::Value message;            // kDictionary: the message
+};
+using xpc_handler_t = std::function<void(const XPCEvent&)>;
+
+inline constexpr uint64_t XPC_CONNECTION_MACH_SERVICE_LISTENER = 1;
+inline constexpr size_t kMaxServiceFrame = 1 << 20;
+
+// Run-loop results.
+inline constexpr int32_t kCFRunLoopRunFinished = 1;
+inline constexpr int32_t kCFRunLoopRunStopped = 2;
+inline constexpr int32_t kCFRunLoopRunTimedOut = 3;
+inline constexpr int32_t kCFRunLoopRunHandledSource = 4;
+
+std::string ServiceSocketPath(std::string_view service_name);
+
+// Sends one message to the service of the current root. False with a reason
+// when there is no socket or the message cannot be sent.
+bool SendServiceMessage(std::string_view service_name, const cf::Value& message, std::string* error);
+
+// Frame helpers, shared by both ends and the fuzz target.
+bool EncodeServiceFrame(const cf::Value& message, std::string* frame, std::string* error);
+// Parses a frame body; a result that is not a dictionary gives an error.
+cf::Value DecodeServiceMessage(std::string_view body, std::string* error);
+
+}  // namespace platform
+
+// Null when the socket cannot be created (the reason goes to the log).
+platform::xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint64_t flags);
+void xpc_connection_set_event_handler(const platform::xpc_connection_t& connection, platform::xpc_handler_t handler);
+// Every connection targets the main queue here; kept for the call sites.
+void xpc_connection_set_target_queue(const platform::xpc_connection_t& connection);
+void xpc_connection_resume(const platform::xpc_connection_t& connection);
+void xpc_connection_cancel(const platform::xpc_connection_t& connection);
+
+// Waits up to seconds for events and runs their handlers.
+int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled);
+
+// Message readers; a missing or mistyped int64 reads as 0.
+int64_t xpc_dictionary_get_int64(const cf::Value& message, std::string_view key);
+const std::string* xpc_dictionary_get_string(const cf::Value& message, std::string_view key);
+std::optional<std::array<uint8_t, 16>> xpc_dictionary_get_uuid(const cf::Value& message, std::string_view key);
+cf::Value xpc_dictionary_get_value(const cf::Value& message, std::string_view key);
+// The hyphenated 8-4-4-4-12 text of a UUID, in upper case.
+std::string uuid_unparse(const std::array<uint8_t, 16>& uuid);
+// Parses that text (either case); nothing for anything else.
+std::optional<std::array<uint8_t, 16>> uuid_parse(std::string_view text);

@@ -1,0 +1,124 @@
+#include "platform/service.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <thread>
+
+#include "../../tests/temp_dir.h"
+#include "cf/plist.h"
+#include "platform/context.h"
+#include "platform/files.h"
+#include "platform/log.h"
+
+namespace platform {
+namespace {
+
+constexpr const char* kName = "com.velmora.test.service";
+
+// Writes raw bytes to the service from a helper thread, as a peer process would.
+void SendRaw(const std::string& path, const std::string& bytes) {
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strcpy(addr.sun_path, path.c_str());
+  const int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0) (void)!write(fd, bytes.data(), bytes.size());
+  close(fd);
+}
+
+std::string Frame(uint32_t length, const std::string& body) {
+  std::string f{static_cast<char>(length >> 24), static_cast<char>(length >> 16), static_cast<char>(length >> 8),
+                static_cast<char>(length)};
+  return f + body;
+}
+
+TEST(ServiceTest, MessagesReachTheHandlerAndBadFramesOnlyEndTheirConnection) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  const std::string path = ServiceSocketPath(kName);
+  ASSERT_TRUE(WriteFileAtomically(path, "stale"));  // an old socket file is replaced
+
+  std::vector<cf::Value> messages;
+  int errors = 0;
+  xpc_connection_t listener = xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER);
+  ASSERT_NE(listener, nullptr);
+  struct stat st;
+  ASSERT_EQ(stat(path.c_str(), &st), 0);
+  EXPECT_TRUE(S_ISSOCK(st.st_mode));
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  xpc_connection_set_event_handler(listener, [&](const XPCEvent& e) {
+    ASSERT_EQ(e.type, XPCEvent::Type::kConnection);
+    xpc_connection_set_event_handler(e.connection, [&](const XPCEvent& m) {
+      if (m.type == XPCEvent::Type::kDictionary) messages.push_back(m.message);
+      else ++errors;
+    });
+    xpc_connection_resume(e.connection);
+  });
+  xpc_connection_resume(listener);
+
+  cf::Dictionary message;
+  message.Set("operation", cf::Value::SInt64(2));
+  message.Set("uuid", cf::Value::Bytes(cf::Data(16, 0xab)));
+  std::string good;
+  ASSERT_TRUE(EncodeServiceFrame(message, &good, nullptr));
+  std::string array_body;
+  ASSERT_TRUE(cf::WriteBinaryPropertyList(cf::Array(), array_body, nullptr));
+
+  std::thread peer([&] {
+    SendRaw(path, good + good);                                    // two messages, one connection
+    SendRaw(path, Frame(1 << 21, ""));                             // over 1 MiB
+    SendRaw(path, Frame(static_cast<uint32_t>(array_body.size()), array_body));  // not a dictionary
+    SendRaw(path, good.substr(0, good.size() - 3));                // closes mid-frame
+    SendRaw(path, Frame(5, "junk!"));                              // not a property list
+    std::string error;
+    SendServiceMessage(kName, message, &error);                    // still serving
+  });
+  const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (messages.size() < 3 && std::chrono::steady_clock::now() < until) CFRunLoopRunInMode(1.0, true);
+  peer.join();
+  while (CFRunLoopRunInMode(0.2, true) != kCFRunLoopRunTimedOut) {
+  }
+  ASSERT_EQ(messages.size(), 3u);
+  EXPECT_EQ(messages[0], cf::Value(message));
+  EXPECT_EQ(xpc_dictionary_get_int64(messages[0], "operation"), 2);
+  EXPECT_EQ(xpc_dictionary_get_int64(messages[0], "missing"), 0);
+  EXPECT_EQ(xpc_dictionary_get_int64(cf::Value("not a dictionary"), "operation"), 0);
+  EXPECT_EQ(uuid_unparse(*xpc_dictionary_get_uuid(messages[0], "uuid")), "ABABABAB-ABAB-ABAB-ABAB-ABABABABABAB");
+  EXPECT_FALSE(xpc_dictionary_get_uuid(messages[0], "operation"));
+  EXPECT_EQ(log->CountContaining("over the limit of 1048576"), 1u);
+  EXPECT_EQ(log->Count("Bad service message (an array, not a dictionary); closing the connection"), 1u);
+  EXPECT_EQ(log->Count("Service peer closed the connection in the middle of a message"), 1u);
+  EXPECT_EQ(log->CountContaining("Bad service message (malformed binary property list)"), 0u);
+  EXPECT_EQ(log->CountContaining("Bad service message ("), 2u);  // the array and the junk
+  EXPECT_GE(errors, 2);
+
+  xpc_connection_cancel(listener);
+  EXPECT_FALSE(FileExists(path));
+  std::string error;
+  EXPECT_FALSE(SendServiceMessage(kName, message, &error));
+  EXPECT_NE(error.find("no service listening at " + path), std::string::npos) << error;
+}
+
+TEST(ServiceTest, RunLoopWithoutSourcesWaitsOutItsTime) {
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_EQ(CFRunLoopRunInMode(0.3, true), kCFRunLoopRunTimedOut);
+  EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(290));
+}
+
+TEST(ServiceTest, UuidText) {
+  const auto u = uuid_parse("0123abcd-4567-89ef-0123-456789ABCDEF");
+  ASSERT_TRUE(u);
+  EXPECT_EQ(uuid_unparse(*u), "0123ABCD-4567-89EF-0123-456789ABCDEF");
+  for (const char* bad : {"", "0123abcd-4567-89ef-0123-456789abcde", "0123abcd-4567-89ef-0123-456789abcdeg",
+                          "0123abcd_4567-89ef-0123-456789abcdef", "0123abcd-4567-89ef-0123-456789abcdef0"})
+    EXPECT_FALSE(uuid_parse(bad)) << bad;
+}
+
+}  // namespace
+}  // namespace platform

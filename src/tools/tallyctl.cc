@@ -1,0 +1,116 @@
+// tallyctl: sends one message to the tallyrun service of TALLYRUN_ROOT.
+#include <CLI/CLI.hpp>
+
+#include <cstdio>
+#include <limits>
+#include <string>
+
+#include "cf/plist.h"
+#include "platform/files.h"
+#include "platform/service.h"
+
+namespace {
+
+constexpr const char* kService = "com.velmora.tallybookd.tallyrun";
+
+int Fail(int status, const std::string& message) {
+  std::fprintf(stderr, "tallyctl: %s\n", message.c_str());
+  return status;
+}
+
+// The app list of FILE: a JSON array of objects with "bundle_id", "version",
+// "adam_id", "arch" and "uuid" (36-character text).
+bool ReadAppData(const std::string& file, cf::Array* out, std::string* error) {
+  const auto text = platform::ReadFile(file, error);
+  if (!text) return false;
+  const cf::ParseResult parsed = cf::ParseJSON(*text);
+  if (!parsed.ok()) {
+    *error = file + ": " + parsed.error;
+    return false;
+  }
+  const cf::Array* apps = parsed.value.AsArray();
+  if (!apps) {
+    *error = file + ": expected a JSON array of app objects";
+    return false;
+  }
+  size_t index = 0;
+  for (const cf::Value& app : *apps) {
+    const std::string where = file + ": app " + std::to_string(index++);
+    const cf::Dictionary* d = app.AsDictionary();
+    if (!d) {
+      *error = where + " is not an object";
+      return false;
+    }
+    cf::Dictionary record;
+    for (const char* key : {"bundle_id", "version"}) {
+      const cf::Value v = d->Get(key);
+      if (!v.AsString()) {
+        *error = where + ": \"" + key + "\" must be text";
+        return false;
+      }
+      record.Set(key, v);
+    }
+    for (const char* key : {"adam_id", "arch"}) {
+      const cf::Value v = d->Get(key);
+      if (!v.AsNumber() || v.AsNumber()->IsFloat()) {
+        *error = where + ": \"" + key + "\" must be an integer";
+        return false;
+      }
+      record.Set(key, cf::Value::SInt64(v.AsNumber()->AsSInt64()));
+    }
+    const cf::Value uuid_text = d->Get("uuid");
+    const auto uuid = uuid_text.AsString() ? uuid_parse(*uuid_text.AsString()) : std::nullopt;
+    if (!uuid) {
+      *error = where + ": \"uuid\" must be 36-character UUID text";
+      return false;
+    }
+    record.Set("uuid", cf::Value::Bytes(cf::Data(uuid->begin(), uuid->end())));
+    out->Append(record);
+  }
+  return true;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app{"Send one message to the tallyrun service of TALLYRUN_ROOT"};
+  app.require_subcommand(1);
+  int64_t day = 0, operation = 0, value = 0;
+  std::string file;
+  auto* logging = app.add_subcommand("logging-status", "Announce that app information will follow (operation 0)");
+  auto* run_day = app.add_subcommand("run-day", "Run the daily tasks for a day (operation 1)");
+  run_day->add_option("DAY", day, "day number")->required();
+  auto* app_data = app.add_subcommand("app-data", "Deliver activated-app information from a JSON file (operation 2)");
+  app_data->add_option("FILE", file)->required();
+  auto* send = app.add_subcommand("send", "Send any operation code");
+  send->add_option("OPERATION", operation)->required();
+  auto* value_opt = send->add_option("--value", value, "the message's \"value\"");
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::CallForHelp& e) {
+    return app.exit(e);
+  } catch (const CLI::ParseError& e) {
+    app.exit(e);
+    return 2;
+  }
+
+  cf::Dictionary message;
+  if (logging->parsed()) {
+    message.Set("operation", cf::Value::SInt64(0));
+  } else if (run_day->parsed()) {
+    message.Set("operation", cf::Value::SInt64(1));
+    message.Set("value", cf::Value::SInt64(day));
+  } else if (app_data->parsed()) {
+    cf::Array apps;
+    std::string error;
+    if (!ReadAppData(file, &apps, &error)) return Fail(2, error);
+    message.Set("operation", cf::Value::SInt64(2));
+    message.Set("app_data", apps);
+  } else {
+    message.Set("operation", cf::Value::SInt64(operation));
+    if (value_opt->count()) message.Set("value", cf::Value::SInt64(value));
+  }
+  std::string error;
+  if (!platform::SendServiceMessage(kService, message, &error)) return Fail(1, error);
+  return 0;
+}

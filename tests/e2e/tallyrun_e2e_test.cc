@@ -1,0 +1,338 @@
+// The daily job as a process: modes, gate, report, OS changes and the
+// service's messages, in a fresh device root made by devsim.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <thread>
+
+#include "../temp_dir.h"
+#include "cf/plist.h"
+#include "platform/files.h"
+#include "run.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+const std::string kDomain = "com.velmora.tallybookd.tallyrun";
+const std::string kGate = "LastCrashLogSerializationDateInDaysSince1970";
+constexpr int32_t kToday = 20779;  // 2026-11-22
+
+cf::Value ReadPlist(const std::string& path) {
+  const auto bytes = platform::ReadFile(path);
+  if (!bytes) return {};
+  return cf::ParsePropertyList(*bytes).value;
+}
+
+class TallyrunTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    const RunResult init = RunProgram(DEVSIM_BIN, {"init", root.path(), "--force"}, env);
+    ASSERT_EQ(init.status, 0) << init.err;
+  }
+
+  RunResult Tallyrun(const std::vector<std::string>& args) { return RunProgram(TALLYRUN_BIN, args, env); }
+  RunResult Tallyctl(const std::vector<std::string>& args) { return RunProgram(TALLYCTL_BIN, args, env); }
+
+  std::vector<std::string> Logs() {
+    std::vector<std::string> out;
+    std::error_code ec;
+    for (const auto& e : fs::directory_iterator(root / "var/diagvault/submissions", ec))
+      if (e.path().extension() == ".193") out.push_back(e.path());
+    // Oldest first. Logs of one second share a stamp and differ by their
+    // "-N" suffix, so order by the suffix's number.
+    auto suffix = [](const std::string& p) {
+      const size_t dot = p.rfind('.'), dash = p.rfind('-');
+      return dash != std::string::npos && dash > p.rfind('_') && dash < dot && dot - dash < 6
+                 ? std::stoi(p.substr(dash + 1, dot - dash - 1))
+                 : 0;
+    };
+    std::sort(out.begin(), out.end(), [&](const std::string& a, const std::string& b) {
+      const std::string sa = a.substr(0, a.rfind('_') + 18), sb = b.substr(0, b.rfind('_') + 18);
+      return sa != sb ? sa < sb : suffix(a) < suffix(b);
+    });
+    return out;
+  }
+  cf::Dictionary LastLog() {
+    const auto logs = Logs();
+    if (logs.empty()) return {};
+    const cf::Value v = ReadPlist(logs.back());
+    return v.AsDictionary() ? *v.AsDictionary() : cf::Dictionary();
+  }
+  cf::Value Pref(const std::string& key) {
+    const cf::Value v = ReadPlist(root / ("Library/Preferences/" + kDomain + ".plist"));
+    return v.AsDictionary() ? v.AsDictionary()->Get(key) : cf::Value();
+  }
+  void WritePlist(const std::string& rel, const cf::Value& v) {
+    std::string bytes;
+    ASSERT_TRUE(cf::WriteXMLPropertyList(v, bytes, nullptr));
+    ASSERT_TRUE(platform::WriteFileAtomically(root / rel, bytes));
+  }
+
+  // Service mode: starts tallyrun without arguments, waits for its socket,
+  // sends the messages with tallyctl, and waits for the process to end.
+  RunResult Serve(const std::vector<std::vector<std::string>>& messages) {
+    const std::string err_file = root / "service.stderr";
+    const pid_t pid = fork();
+    if (pid == 0) {
+      freopen(err_file.c_str(), "w", stderr);
+      for (const auto& [k, v] : env) setenv(k.c_str(), v.c_str(), 1);
+      execl(TALLYRUN_BIN, TALLYRUN_BIN, static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    const std::string socket = root / "var/run/com.velmora.tallybookd.tallyrun.sock";
+    for (int i = 0; i < 500 && !platform::FileExists(socket); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    for (const auto& m : messages) EXPECT_EQ(Tallyctl(m).status, 0);
+    RunResult r;
+    int status = 0;
+    for (int i = 0; i < 6000 && waitpid(pid, &status, WNOHANG) == 0; ++i)
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    if (waitpid(pid, &status, WNOHANG) == 0) {
+      kill(pid, SIGKILL);
+      waitpid(pid, &status, 0);
+    }
+    r.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    r.err = platform::ReadFile(err_file).value_or("");
+    EXPECT_FALSE(platform::FileExists(socket)) << "the socket is removed at exit";
+    return r;
+  }
+
+  TempDir root;
+  std::map<std::string, std::string> env{{"TALLYRUN_ROOT", root.path()},
+                                         {"TALLYRUN_NOW", "2026-11-22T15:00:00Z"},
+                                         {"TZ", "UTC0"},
+                                         {"TALLYRUN_LOG_STDERR", "1"},
+                                         {"TALLYRUN_SERVICE_IDLE_SECONDS", "2"}};
+};
+
+size_t Count(const std::string& haystack, const std::string& needle) {
+  size_t n = 0;
+  for (size_t at = haystack.find(needle); at != std::string::npos; at = haystack.find(needle, at + 1)) ++n;
+  return n;
+}
+
+TEST_F(TallyrunTest, GatedRunHappensOncePerDay) {
+  RunResult r = Tallyrun({"-d"});
+  EXPECT_EQ(r.status, 0);
+  EXPECT_EQ(Count(r.err, "<default>: tallyrun started\n"), 1u);
+  EXPECT_EQ(Count(r.err, "<default>: daily tasks for day 20778\n"), 1u);
+  EXPECT_EQ(Count(r.err, "<info>: writing aggregated log. yesterday=20778\n"), 1u);
+  EXPECT_EQ(Count(r.err, "<default>: tallyrun ended\n"), 1u);
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
+  ASSERT_EQ(Logs().size(), 1u);
+  EXPECT_EQ(fs::path(Logs()[0]).filename(), "log-aggregated_2026-11-22-150000.193");
+
+  const cf::Dictionary log = LastLog();
+  EXPECT_EQ(log.Get("TBCrashLogVersion"), cf::Value::SInt64(1));
+  EXPECT_EQ(log.Get("TBStartDate"), cf::Value(cf::Date{86400.0 * (kToday - 1)}));
+  EXPECT_EQ(log.Get("TBLogCreationDate"), cf::Value(cf::Date{86400.0 * kToday + 15 * 3600}));
+  const cf::Dictionary& scalars = *log.Get("TBScalars").AsDictionary();
+  EXPECT_TRUE(scalars.Contains("com.velmora.homedeck.Unlocks"));
+  EXPECT_TRUE(scalars.Contains("com.velmora.wifi.Roams"));               // by prefix
+  EXPECT_FALSE(scalars.Contains("com.velmora.camera.PhotosTaken"));      // not listed
+  EXPECT_FALSE(scalars.Contains("com.velmora.debug.Asserts"));           // internal only
+  EXPECT_EQ(scalars.Get("com.velmora.power.ChargeCycles"), cf::Value::SInt64(412));
+  EXPECT_EQ(scalars.Get("com.velmora.homedeck.AppLaunches").AsNumber()->AsSInt64() % 10, 0);
+  EXPECT_EQ(log.Get("TBDistributions").AsDictionary()->Get("com.velmora.power.BatteryTemperatureC").AsArray()->at(4),
+            cf::Value::SInt64(288));
+  EXPECT_TRUE(log.Get("TBDistributionsHistogram").AsDictionary()->Contains("com.velmora.net.DNSLatencyMs"));
+  EXPECT_FALSE(log.Get("TBDistributionsHistogram").AsDictionary()->Contains("com.velmora.net.ThroughputKbps"));
+  EXPECT_EQ(log.Get("TBTasking"), cf::Value(cf::Array()));
+  EXPECT_EQ(log.Get("TBTaskID"), cf::Value("(no tasking id)"));
+  EXPECT_EQ(log.Get("TBTaskDigest"), cf::Value("(no tasking digest)"));
+  EXPECT_EQ(log.Get("TBWhitelistDigest").AsString()->size(), 32u);
+  EXPECT_FALSE(log.Contains("TBActivatedAppInfo"));
+  std::vector<std::string> keys;
+  for (const auto& [k, v] : log) keys.push_back(*k.AsString());
+  EXPECT_EQ(keys, (std::vector<std::string>{"TBCrashLogVersion", "TBStartDate", "TBLogCreationDate", "TBMetadata",
+                                            "TBScalars", "TBDistributions", "TBDistributionsHistogram", "TBTasking",
+                                            "TBTaskID", "TBTaskDigest", "TBWhitelistDigest"}));
+
+  r = Tallyrun({"-d"});
+  EXPECT_EQ(Count(r.err, "<default>: Day unchanged since last run\n"), 1u);
+  EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
+  EXPECT_EQ(Logs().size(), 1u);
+
+  // A gate record ahead of the clock (the clock was set back) counts as unchanged.
+  env["TALLYRUN_NOW"] = "2026-11-20T15:00:00Z";
+  EXPECT_EQ(Count(Tallyrun({"-d"}).err, "Day unchanged since last run"), 1u);
+  // The next day runs again.
+  env["TALLYRUN_NOW"] = "2026-11-23T09:00:00Z";
+  EXPECT_EQ(Count(Tallyrun({"-d"}).err, "daily tasks for day 20779"), 1u);
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday));
+}
+
+TEST_F(TallyrunTest, ForceTodayAndArguments) {
+  RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20778"), 1u);
+  EXPECT_TRUE(Pref(kGate).IsNull());  // -f neither reads nor writes the gate
+  EXPECT_EQ(Logs().size(), 1u);
+
+  r = Tallyrun({"-t"});
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20779"), 1u);
+  EXPECT_EQ(LastLog().Get("TBStartDate"), cf::Value(cf::Date{86400.0 * kToday}));
+  EXPECT_EQ(Logs().size(), 2u);
+
+  r = Tallyrun({"-x", "-d"});
+  EXPECT_EQ(r.status, 0);
+  EXPECT_EQ(Count(r.err, "<default>: Unknown arg: -x\n"), 1u);
+  EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
+  EXPECT_EQ(Logs().size(), 2u);
+
+  r = Tallyrun({"-d", "-f"});  // only the first argument counts
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20778"), 1u);
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
+  EXPECT_EQ(Count(Tallyrun({"-d"}).err, "Day unchanged since last run"), 1u);
+  EXPECT_EQ(Tallyrun({""}).status, 0);
+}
+
+TEST_F(TallyrunTest, NoLogWithoutSubmissionOrWhitelistedData) {
+  cf::Dictionary answers;
+  answers.Set("DiagnosticLogSubmissionEnabled", cf::Value::Bool(false));
+  WritePlist("device/answers.plist", answers);
+  RunResult r = Tallyrun({"-d"});
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20778"), 1u);
+  EXPECT_EQ(Count(r.err, "writing aggregated log"), 0u);
+  EXPECT_TRUE(Logs().empty());
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));  // advanced all the same
+
+  fs::remove(root / "device/answers.plist");
+  env["TALLYRUN_NOW"] = "2027-01-01T12:00:00Z";  // a day the store has no rows for
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "writing aggregated log"), 1u);
+  EXPECT_TRUE(Logs().empty());
+
+  env["TALLYRUN_NOW"] = "2026-11-22T15:00:00Z";
+  fs::remove(root / "Library/Application Support/Tallybook/Whitelist_boxOS.plist");
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "<error>: Couldn't load whitelist\n"), 1u);
+  EXPECT_TRUE(Logs().empty());
+  EXPECT_TRUE(Pref("LastOSVersion").IsNull());  // nothing serialized, nothing recorded
+}
+
+TEST_F(TallyrunTest, OSChangeIsReportedOnce) {
+  auto options_of_last = [&] {
+    const auto json = platform::ReadFile(Logs().back() + ".json");
+    return cf::ParseJSON(json.value_or("")).value.AsDictionary()->Get("options");
+  };
+  Tallyrun({"-f"});
+  cf::Dictionary first;
+  first.Set("previous_os_version", "<unknown>");
+  EXPECT_EQ(options_of_last(), cf::Value(first));
+  EXPECT_EQ(Pref("LastOSVersion"), cf::Value("4.2 (22C41)"));
+  Tallyrun({"-f"});
+  EXPECT_EQ(options_of_last(), cf::Value(cf::Dictionary()));
+
+  cf::Dictionary version;
+  version.Set("ProductVersion", "4.3");
+  version.Set("ProductBuildVersion", "22D10");
+  WritePlist("device/system-version.plist", version);
+  Tallyrun({"-f"});
+  cf::Dictionary changed;
+  changed.Set("previous_os_version", "4.2 (22C41)");
+  EXPECT_EQ(options_of_last(), cf::Value(changed));
+  Tallyrun({"-f"});
+  EXPECT_EQ(options_of_last(), cf::Value(cf::Dictionary()));
+  EXPECT_EQ(Logs().size(), 4u);
+}
+
+TEST_F(TallyrunTest, ServiceRunsTheGateWithRequestedAppInfo) {
+  const std::string apps = root / "apps.json";
+  ASSERT_TRUE(platform::WriteFileAtomically(apps, R"([
+    {"bundle_id": "com.example.notes", "version": "3.1", "adam_id": 123456789, "arch": 16777228,
+     "uuid": "0a1b2c3d-4e5f-6071-8293-a4b5c6d7e8f9"},
+    {"bundle_id": "com.example.maps", "version": "1.0", "adam_id": -1, "arch": 0,
+     "uuid": "FFFFFFFF-0000-0000-0000-000000000000"}])"));
+  const RunResult r = Serve({{"logging-status"}, {"app-data", apps}});
+  EXPECT_EQ(r.status, 0);
+  EXPECT_EQ(Count(r.err, "notified of logging status, waiting for activate app info"), 1u);
+  EXPECT_EQ(Count(r.err, "tallyrun got requestedAAI:\n("), 1u);
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20778"), 1u);
+  EXPECT_EQ(Count(r.err, "never received requested AAI"), 0u);
+  EXPECT_EQ(Count(*platform::ReadFile(root / "var/run/notifications.log"),
+                  "2026-11-22T15:00:00Z com.velmora.tallybookd.tallyrun.logging\n"),
+            1u);
+  const cf::Value info = LastLog().Get("TBActivatedAppInfo");
+  ASSERT_NE(info.AsArray(), nullptr);
+  ASSERT_EQ(info.AsArray()->size(), 2u);
+  cf::Dictionary first;
+  first.Set("bundle", "com.example.notes");
+  first.Set("version", "3.1");
+  first.Set("adamID", cf::Value::SInt64(123456789));
+  first.Set("arch", cf::Value::SInt64(16777228));
+  first.Set("uuid", "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9");
+  EXPECT_EQ(info.AsArray()->at(0), cf::Value(first));
+  EXPECT_EQ(info.AsArray()->at(1).AsDictionary()->Get("adamID"), cf::Value::SInt64(-1));
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
+}
+
+TEST_F(TallyrunTest, ServiceSingleTurnAndUnsolicitedAppInfo) {
+  const std::string empty = root / "empty.json";
+  ASSERT_TRUE(platform::WriteFileAtomically(empty, "[]"));
+  // Unsolicited app information only logs.
+  RunResult r = Serve({{"app-data", empty}});
+  EXPECT_EQ(Count(r.err, "tallyrun got (unsolicited -- so ignoring) AAI:\n()"), 1u);
+  EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
+  EXPECT_TRUE(Logs().empty());
+
+  // Operation 1 runs that day, ungated; a later operation 0 is ignored.
+  r = Serve({{"run-day", "20000"}, {"logging-status"}, {"app-data", empty}});
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20000"), 1u);
+  EXPECT_EQ(Count(r.err, "notified of logging status"), 0u);
+  EXPECT_EQ(Count(r.err, "(unsolicited -- so ignoring) "), 1u);
+  EXPECT_TRUE(Pref(kGate).IsNull());
+  EXPECT_FALSE(platform::FileExists(root / "var/run/notifications.log"));
+
+  // An unknown operation uses up the turn too.
+  r = Serve({{"send", "5"}, {"logging-status"}});
+  EXPECT_EQ(Count(r.err, "notified of logging status"), 0u);
+  EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
+  // The low 32 bits decide: 2^32 + 1 is operation 1.
+  r = Serve({{"send", "4294967297", "--value", "20001"}});
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20001"), 1u);
+}
+
+TEST_F(TallyrunTest, ServiceRunsWithoutAppInfoWhenItNeverComes) {
+  const RunResult r = Serve({{"logging-status"}});
+  EXPECT_EQ(Count(r.err, "<default>: never received requested AAI, so moving along without it\n"), 1u);
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20778"), 1u);
+  EXPECT_EQ(Logs().size(), 1u);
+  EXPECT_FALSE(LastLog().Contains("TBActivatedAppInfo"));
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
+}
+
+TEST_F(TallyrunTest, IdleServiceEndsAfterTenQuietSeconds) {
+  env.erase("TALLYRUN_SERVICE_IDLE_SECONDS");
+  const auto start = std::chrono::steady_clock::now();
+  const RunResult r = Serve({});
+  const auto took = std::chrono::steady_clock::now() - start;
+  EXPECT_GE(took, std::chrono::seconds(10));
+  EXPECT_LT(took, std::chrono::seconds(20));
+  EXPECT_EQ(r.status, 0);
+  EXPECT_EQ(Count(r.err, "\n"), 2u);  // the start and end lines only
+  EXPECT_EQ(Count(r.err, "tallyrun started"), 1u);
+  EXPECT_EQ(Count(r.err, "tallyrun ended"), 1u);
+}
+
+TEST_F(TallyrunTest, ToolsRefuseBadInput) {
+  RunResult r = Tallyctl({"logging-status"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_NE(r.err.find("tallyctl: no service listening at " + (root / "var/run/com.velmora.tallybookd.tallyrun.sock")),
+            std::string::npos) << r.err;
+  ASSERT_TRUE(platform::WriteFileAtomically(root / "bad.json", R"([{"bundle_id": "x", "version": "1", "adam_id": 1, "arch": 1, "uuid": "nope"}])"));
+  r = Tallyctl({"app-data", root / "bad.json"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_EQ(r.err, "tallyctl: " + (root / "bad.json") + ": app 0: \"uuid\" must be 36-character UUID text\n");
+  EXPECT_EQ(Tallyctl({"app-data", root / "missing.json"}).status, 2);
+  EXPECT_EQ(Tallyctl({"run-day", "soon"}).status, 2);
+
+  r = RunProgram(DEVSIM_BIN, {"init", root.path()}, env);
+  EXPECT_EQ(r.status, 2);
+  EXPECT_EQ(r.err, "devsim: " + root.path() + " is not empty (use --force to write into it)\n");
+}
+
+}  // namespace
