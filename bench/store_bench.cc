@@ -4,8 +4,6 @@
 //
 //   store_bench [--keys N] [--samples N] [--scalars N] [--dir DIR]
 //   store_bench --stream-only PATH   (one streaming pass; used for peak memory)
-#include <sys/resource.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -17,6 +15,7 @@
 #include <string>
 #include <vector>
 
+#include "bench_util.h"
 #include "platform/history.h"
 #include "platform/store.h"
 
@@ -36,10 +35,6 @@ struct Summary {
     m2 += delta * (v - mean);
   }
 };
-
-double Seconds(std::chrono::steady_clock::time_point since) {
-  return std::chrono::duration<double>(std::chrono::steady_clock::now() - since).count();
-}
 
 // One pass over every scalar and sample of the day; returns a checksum so the
 // work cannot be optimised away.
@@ -64,66 +59,8 @@ double StreamDay(const std::string& path) {
   return check;
 }
 
-int RunShell(const std::string& path) {
-  const std::string sql =
-      "SELECT key, value FROM scalars WHERE day = " + std::to_string(kDay) +
-      ";"
-      "SELECT s.key, count(*), min(value), max(value), avg(value), sum(value * value) "
-      "FROM samples JOIN series s ON s.id = samples.series WHERE s.day = " +
-      std::to_string(kDay) + " GROUP BY samples.series;";
-  std::fflush(stdout);
-  const pid_t pid = fork();
-  if (pid == 0) {
-    freopen("/dev/null", "w", stdout);
-    execlp("sqlite3", "sqlite3", path.c_str(), sql.c_str(), static_cast<char*>(nullptr));
-    _exit(127);
-  }
-  int status = 0;
-  waitpid(pid, &status, 0);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 1;
-}
-
-void Fill(const std::string& path, int scalars, int keys, int samples) {
-  std::string error;
-  auto store = platform::TallyStore::Open(path, platform::TallyStore::Mode::kCreate, &error);
-  if (!store) {
-    std::fprintf(stderr, "%s\n", error.c_str());
-    std::exit(1);
-  }
-  store->Batch([&] {
-    for (int i = 0; i < scalars; ++i)
-      if (!store->SetScalar(kDay, "com.velmora.bench.scalar." + std::to_string(i), i)) return false;
-    return true;
-  });
-  std::vector<std::pair<double, int32_t>> values(static_cast<size_t>(samples));
-  uint64_t x = 88172645463325252ULL;
-  for (int k = 0; k < keys; ++k) {
-    for (auto& [v, off] : values) {
-      x ^= x << 13, x ^= x >> 7, x ^= x << 17;  // xorshift: cheap, repeatable
-      v = static_cast<double>(x % 100000) / 100.0;
-      off = static_cast<int32_t>(x % 86400);
-    }
-    if (!store->PushSamples(kDay, "com.velmora.bench.dist." + std::to_string(k), values)) {
-      std::fprintf(stderr, "%s\n", store->last_error().c_str());
-      std::exit(1);
-    }
-  }
-  store->Checkpoint();
-}
-
 // Peak resident memory of one streaming pass in a fresh process.
-long PeakKiB(const char* self, const std::string& path) {
-  std::fflush(stdout);
-  const pid_t pid = fork();
-  if (pid == 0) {
-    execl(self, self, "--stream-only", path.c_str(), static_cast<char*>(nullptr));
-    _exit(127);
-  }
-  int status = 0;
-  struct rusage usage;
-  wait4(pid, &status, 0, &usage);
-  return usage.ru_maxrss;
-}
+long PeakKiB(const char* self, const std::string& path) { return bench::Run({self, "--stream-only", path}).peak_kib; }
 
 }  // namespace
 
@@ -150,22 +87,22 @@ int main(int argc, char** argv) {
   const std::string small = dir + "/small.sqlitedb";
 
   auto t = std::chrono::steady_clock::now();
-  Fill(big, scalars, keys, samples);
-  std::printf("filled %d scalars and %d keys x %d samples in %.1f s\n", scalars, keys, samples, Seconds(t));
+  bench::Fill(big, kDay, scalars, keys, samples);
+  std::printf("filled %d scalars and %d keys x %d samples in %.1f s\n", scalars, keys, samples, bench::Seconds(t));
   const int small_keys = std::max(1, keys / 10);
-  Fill(small, 0, small_keys, samples);
+  bench::Fill(small, kDay, 0, small_keys, samples);
 
   double ours = 1e9, shell = 1e9, check = 0;
   for (int round = 0; round < 3; ++round) {
     t = std::chrono::steady_clock::now();
     check += StreamDay(big);
-    ours = std::min(ours, Seconds(t));
-    t = std::chrono::steady_clock::now();
-    if (RunShell(big) != 0) {
+    ours = std::min(ours, bench::Seconds(t));
+    const bench::ProcessRun reference = bench::Run(bench::ShellAggregates(big, kDay));
+    if (reference.status != 0) {
       std::fprintf(stderr, "the sqlite3 shell failed\n");
       return 1;
     }
-    shell = std::min(shell, Seconds(t));
+    shell = std::min(shell, reference.seconds);
   }
   std::printf("history stream + summaries: %.3f s (best of 3)\n", ours);
   std::printf("sqlite3 shell GROUP BY:     %.3f s (best of 3)\n", shell);
