@@ -14,6 +14,12 @@ class Clock {
   virtual double Now() = 0;
   // Nanoseconds of CLOCK_MONOTONIC (does not advance in suspend).
   virtual uint64_t MonotonicNanos() = 0;
+  // How MonotonicNanos ticks relate to nanoseconds; false when unknown.
+  virtual bool Timebase(uint32_t* numer, uint32_t* denom) {
+    *numer = 1;
+    *denom = 1;
+    return true;
+  }
 };
 
 // time(), or the fixed instant of TALLYRUN_NOW when it is set and valid.
@@ -35,10 +41,22 @@ class FixedClock : public Clock {
   uint64_t MonotonicNanos() override { return mono_; }
   void Set(double now) { now_ = now; }
   void AdvanceMonotonic(uint64_t ns) { mono_ += ns; }
+  bool Timebase(uint32_t* numer, uint32_t* denom) override {
+    *numer = numer_;
+    *denom = denom_;
+    return timebase_ok_;
+  }
+  void SetTimebase(uint32_t numer, uint32_t denom, bool ok = true) {
+    numer_ = numer;
+    denom_ = denom;
+    timebase_ok_ = ok;
+  }
 
  private:
   double now_;
   uint64_t mono_ = 1'000'000'000;
+  uint32_t numer_ = 1, denom_ = 1;
+  bool timebase_ok_ = true;
 };
 
 // Epoch seconds ("1700000000", "-5.5") or an ISO-8601 date-time

@@ -24,7 +24,7 @@ Context& DefaultContext() {
   static Context* context = [] {
     auto* c = new Context(EnvOr("TALLYRUN_ROOT", "/var/lib/tallyrun"), Backends{});
     std::atexit([] {
-      if (g_current == nullptr) DefaultContext().preferences().SynchronizeAll();
+      if (g_current == nullptr) DefaultContext().SynchronizeAllPreferences();
     });
     return c;
   }();
@@ -45,7 +45,16 @@ Context::Context(std::string root, Backends backends)
   while (root_.size() > 1 && root_.back() == '/') root_.pop_back();
   if (!backends_.clock) backends_.clock = std::make_shared<SystemClock>();
   if (!backends_.log) backends_.log = std::make_shared<SyslogSink>();
-  preferences_ = std::make_unique<Preferences>(Path("/Library/Preferences"));
+}
+
+Preferences& Context::PreferencesAt(const std::string& device_dir) {
+  auto& slot = preference_stores_[device_dir];
+  if (!slot) slot = std::make_unique<Preferences>(Path(device_dir));
+  return *slot;
+}
+
+void Context::SynchronizeAllPreferences() {
+  for (auto& [dir, prefs] : preference_stores_) prefs->SynchronizeAll();
 }
 
 Context::~Context() = default;

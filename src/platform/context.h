@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -18,6 +19,8 @@ class TallyStore;
 struct Backends {
   std::shared_ptr<Clock> clock;  // default: system clock honouring TALLYRUN_NOW
   std::shared_ptr<LogSink> log;  // default: syslog (mirrored to stderr on request)
+  // False models a device without the analytics library (weakly linked).
+  bool analytics_available = true;
 };
 
 class Context {
@@ -39,7 +42,12 @@ class Context {
 
   Clock& clock() { return *backends_.clock; }
   LogSink& log() { return *backends_.log; }
-  Preferences& preferences() { return *preferences_; }
+  Preferences& preferences() { return PreferencesAt("/Library/Preferences"); }
+  // A preference store of one file per domain in a device directory (the
+  // diagnostics configuration, other users' preferences).
+  Preferences& PreferencesAt(const std::string& device_dir);
+  void SynchronizeAllPreferences();
+  bool analytics_available() const { return backends_.analytics_available; }
   // The store client's connection, opened on first use; null (with a reason
   // in *error) when the store cannot be opened.
   TallyStore* store(std::string* error = nullptr);
@@ -49,7 +57,7 @@ class Context {
   std::string root_;
   uint64_t id_;
   Backends backends_;
-  std::unique_ptr<Preferences> preferences_;
+  std::map<std::string, std::unique_ptr<Preferences>> preference_stores_;
   std::unique_ptr<TallyStore> store_;
   std::string store_error_;
   bool store_tried_ = false;

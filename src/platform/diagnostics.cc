@@ -18,6 +18,7 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "platform/profile.h"
 #include "platform/store.h"
 
 namespace platform {
@@ -52,20 +53,6 @@ std::string LocalStamp(double t, const char* format) {
   char buf[64];
   std::strftime(buf, sizeof buf, format, &tm);
   return buf;
-}
-
-cf::Dictionary ReadDictionaryFile(const std::string& device_path) {
-  const std::string path = Context::Current().Path(device_path);
-  std::string error;
-  const auto bytes = ReadFile(path, &error);
-  if (!bytes) return {};
-  const cf::ParseResult parsed = cf::ParsePropertyList(*bytes);
-  if (!parsed.ok() || !parsed.value.AsDictionary()) {
-    LogError("%s is not a property-list dictionary (%s); ignoring it", path,
-             parsed.ok() ? "root is " + cf::TypeNameWithArticle(parsed.value.type()) : parsed.error);
-    return {};
-  }
-  return *parsed.value.AsDictionary();
 }
 
 struct Entry {
@@ -155,38 +142,22 @@ bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, cons
 }
 
 std::string DGVOSVersion() {
-  const cf::Dictionary sv = ReadDictionaryFile("/device/system-version.plist");
+  const cf::Dictionary sv = ReadProfileDictionary("/device/system-version.plist");
   const cf::Value version = sv.Get("ProductVersion");
   const cf::Value build = sv.Get("ProductBuildVersion");
   if (version.AsString() && build.AsString()) return *version.AsString() + " (" + *build.AsString() + ")";
 
   // No device profile: describe the Linux system itself.
-  std::string version_id, build_id, codename;
-  if (const auto text = ReadFile("/etc/os-release")) {
-    size_t start = 0;
-    while (start < text->size()) {
-      size_t end = text->find('\n', start);
-      if (end == std::string::npos) end = text->size();
-      const std::string line = text->substr(start, end - start);
-      start = end + 1;
-      const size_t eq = line.find('=');
-      if (eq == std::string::npos) continue;
-      std::string value = line.substr(eq + 1);
-      if (value.size() >= 2 && (value.front() == '"' || value.front() == '\'') && value.back() == value.front())
-        value = value.substr(1, value.size() - 2);
-      const std::string key = line.substr(0, eq);
-      if (key == "VERSION_ID") version_id = value;
-      else if (key == "BUILD_ID") build_id = value;
-      else if (key == "VERSION_CODENAME") codename = value;
-    }
-  }
-  if (version_id.empty()) version_id = "unknown";
-  const std::string build_text = !build_id.empty() ? build_id : !codename.empty() ? codename : "unknown";
-  return version_id + " (" + build_text + ")";
+  auto release = ReadOsRelease();
+  const std::string version_id = release["VERSION_ID"].empty() ? "unknown" : release["VERSION_ID"];
+  const std::string build_id = !release["BUILD_ID"].empty()           ? release["BUILD_ID"]
+                               : !release["VERSION_CODENAME"].empty() ? release["VERSION_CODENAME"]
+                                                                      : "unknown";
+  return version_id + " (" + build_id + ")";
 }
 
 cf::Value DVCopyAnswer(std::string_view question) {
-  return ReadDictionaryFile("/device/answers.plist").Get(std::string(question));
+  return ReadProfileDictionary("/device/answers.plist").Get(std::string(question));
 }
 
 bool DVGetBoolAnswer(std::string_view question) {

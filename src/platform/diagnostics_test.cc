@@ -76,7 +76,7 @@ TEST_F(DiagnosticsTest, AnswersAndOSVersion) {
   EXPECT_FALSE(DVGetBoolAnswer("InternalBuild"));
   ASSERT_TRUE(WriteFileAtomically(root / "device/answers.plist", "not a plist"));
   EXPECT_TRUE(DiagnosticLogSubmissionEnabled());
-  EXPECT_EQ(log->CountContaining("answers.plist is not a property-list dictionary"), 1u);
+  EXPECT_EQ(log->CountContaining("answers.plist is not a property list (malformed XML property list)"), 1u);
   cf::Dictionary answers;
   answers.Set("DiagnosticLogSubmissionEnabled", cf::Value::Bool(false));
   answers.Set("InternalBuild", cf::Value::SInt32(1));

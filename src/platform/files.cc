@@ -53,6 +53,12 @@ bool FileExists(const std::string& path) {
   return stat(path.c_str(), &st) == 0;
 }
 
+std::optional<int64_t> FileSize(const std::string& path) {
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return std::nullopt;
+  return static_cast<int64_t>(st.st_size);
+}
+
 bool MakeDirectories(const std::string& path) {
   if (path.empty()) return false;
   struct stat st;

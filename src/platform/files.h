@@ -1,6 +1,7 @@
 // File helpers behind the seam: whole-file reads and atomic replacement.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -21,6 +22,8 @@ bool WriteFileAtomically(const std::string& path, std::string_view bytes, std::s
                          int mode = 0644);
 
 bool FileExists(const std::string& path);
+// The size of a file in bytes (stat), or nothing when it cannot be stat'ed.
+std::optional<int64_t> FileSize(const std::string& path);
 
 namespace testing {
 // Called after the temp file is complete and synced, before the rename; a

@@ -9,6 +9,7 @@
 #include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
+#include "platform/faultkeep.h"
 #include "platform/files.h"
 #include "platform/store.h"
 
@@ -24,6 +25,71 @@ cf::Value Bounds(std::initializer_list<int64_t> bounds) {
   cf::Array a;
   for (int64_t b : bounds) a.Append(cf::Value::SInt64(b));
   return a;
+}
+
+constexpr const char* kMetricKeys[] = {
+    "com.velmora.homedeck.numAllInstalledApps",
+    "com.velmora.homedeck.numThirdPartyApps",
+    "com.velmora.diagvault.tbkd.database.size",
+    "com.velmora.diagvault.tbkd.database.corruptions",
+    "com.velmora.usage.cur_boot_session_cpu_uptime",
+    "com.velmora.kernel.memorystatus_freeze_count",
+    "com.velmora.kernel.memorystatus_freeze_pageouts",
+    "com.velmora.memorystatus_freezer_thaws_per_gb",
+    "com.velmora.kernel.memorystatus_freeze_budget_pages_remaining",
+    "com.velmora.kernel.memorystatus_thaw_count",
+    "com.velmora.kernel.swapusage",
+    "com.velmora.memorystatus_freezer_error_no_compressor_space_count",
+    "com.velmora.memorystatus_freezer_error_no_swap_space_count",
+    "com.velmora.memorystatus_freezer_error_below_min_pages_count",
+    "com.velmora.memorystatus_freezer_error_low_probability_of_use_count",
+    "com.velmora.memorystatus_freezer_error_other_count",
+    "com.velmora.memorystatus_freezer_process_considered_count",
+    "com.velmora.memorystatus_freezer_skipped_full_count",
+    "com.velmora.memorystatus_freezer_thaw_percentage",
+    "com.velmora.memorystatus_freezer_refreeze_average",
+};
+
+// A plausible kernel: about 2 GiB frozen since boot, a few hundred freezer
+// decisions, a dozen refreezes.
+cf::Dictionary SysctlProfile() {
+  const std::pair<const char*, int64_t> values[] = {
+      {"kern.memorystatus_freeze_count", 37},
+      {"kern.memorystatus_freeze_pageouts", 524288},
+      {"kern.memorystatus_thaw_count_since_boot", 123},
+      {"kern.memorystatus_freeze_budget_pages_remaining", 1048576},
+      {"kern.memorystatus_thaw_count", 95},
+      {"kern.memorystatus_freezer_process_considered_count", 400},
+      {"kern.memorystatus_freezer_error_no_compressor_space_count", 4},
+      {"kern.memorystatus_freezer_error_no_swap_space_count", 2},
+      {"kern.memorystatus_freezer_error_below_min_pages_count", 60},
+      {"kern.memorystatus_freezer_error_low_probability_of_use_count", 30},
+      {"kern.memorystatus_freezer_error_other_count", 1},
+      {"kern.memorystatus_freezer_below_threshold_count", 50},
+      {"kern.memorystatus_freezer_skipped_full_count", 5},
+      {"kern.memorystatus_freezer_thaw_percentage", 23},
+      {"kern.memorystatus_freezer_refreeze_count", 12},
+      {"kern.memorystatus_freezer_bytes_refrozen", 98304000},
+  };
+  cf::Dictionary d;
+  for (const auto& [name, value] : values) d.Set(name, cf::Value::SInt64(value));
+  return d;
+}
+
+cf::Array Apps() {
+  const std::pair<const char*, const char*> apps[] = {
+      {"com.velmora.homedeck", "System"},   {"com.velmora.camera", "System"},   {"com.velmora.settings", "System"},
+      {"com.velmora.mail", "System"},       {"com.example.notes", "User"},      {"com.example.maps", "User"},
+      {"com.example.podcasts", "User"},
+  };
+  cf::Array out;
+  for (const auto& [id, type] : apps) {
+    cf::Dictionary app;
+    app.Set("bundleIdentifier", id);
+    app.Set("bundleType", type);
+    out.Append(app);
+  }
+  return out;
 }
 
 cf::Dictionary Whitelist() {
@@ -49,6 +115,9 @@ cf::Dictionary Whitelist() {
       {"DistributionKeys",
        Options({{"com.velmora.net.DNSLatencyMs", Options({{"intervals", Bounds({10, 50, 100, 500})}})}})},
   });
+  // Every report-side metric the report can add.
+  cf::Dictionary system_scalars;
+  for (const char* key : kMetricKeys) system_scalars.Set(key, cf::Dictionary());
   cf::Dictionary internal = Options({
       {"ScalarKeyPrefixes", Options({{"com.velmora.debug.", cf::Dictionary()}})},
   });
@@ -56,6 +125,7 @@ cf::Dictionary Whitelist() {
       {"Homedeck", Options({{"ScalarKeys", homedeck_scalars}, {"DistributionKeys", homedeck_dists}})},
       {"Power", Options({{"ScalarKeys", power_scalars}, {"DistributionKeys", power_dists}})},
       {"Network", network},
+      {"System", Options({{"ScalarKeys", system_scalars}})},
       {"InternalTesting", internal},
   });
 }
@@ -108,7 +178,7 @@ bool FillDay(platform::TallyStore& store, int32_t day, double fraction_of_day) {
 
 }  // namespace
 
-bool WriteDefaultRoot(const std::string& root, std::string* error) {
+bool WriteDefaultRoot(const std::string& root, const std::string& support_library, std::string* error) {
   platform::ContextScope scope(root);
   platform::Context& c = scope.context();
   if (!WritePlist(c.Path("/Library/Application Support/Tallybook/Whitelist_boxOS.plist"), Whitelist(), error))
@@ -116,12 +186,20 @@ bool WriteDefaultRoot(const std::string& root, std::string* error) {
   cf::Dictionary answers;
   answers.Set("DiagnosticLogSubmissionEnabled", cf::Value::Bool(true));
   answers.Set("InternalBuild", cf::Value::Bool(false));
+  answers.Set("SystemLanguages", cf::Array({cf::Value("en"), cf::Value("de"), cf::Value("fr"), cf::Value("ja")}));
   if (!WritePlist(c.Path("/device/answers.plist"), answers, error)) return false;
   cf::Dictionary version;
   version.Set("ProductName", "boxOS");
   version.Set("ProductVersion", "4.2");
   version.Set("ProductBuildVersion", "22C41");
   if (!WritePlist(c.Path("/device/system-version.plist"), version, error)) return false;
+  if (!WritePlist(c.Path("/device/sysctl.plist"), SysctlProfile(), error)) return false;
+  if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
+  if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), cf::Array({cf::Value("com.velmora.homedeck.appInstalls")}),
+                  error))
+    return false;
+  const auto library = platform::ReadFile(support_library, error);
+  if (!library || !platform::WriteFileAtomically(c.Path(kFaultkeepSupportPath), *library, error, 0755)) return false;
 
   // A fresh store: yesterday in full, today up to the clock's time of day.
   const std::string store_path = c.Path(platform::kStoreDevicePath);

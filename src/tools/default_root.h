@@ -3,6 +3,8 @@
 
 #include <string>
 
-// Writes the whitelist, the device profile and a store holding a realistic
+// Writes the whitelist, the device profile (answers, version, kernel
+// variables, apps), the enabled analytics events, the crash-report support
+// library (copied from support_library) and a store holding a realistic
 // yesterday and today (relative to the platform clock) into root.
-bool WriteDefaultRoot(const std::string& root, std::string* error);
+bool WriteDefaultRoot(const std::string& root, const std::string& support_library, std::string* error);

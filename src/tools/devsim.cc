@@ -8,6 +8,22 @@
 
 #include "tools/default_root.h"
 
+namespace {
+
+// The support library built beside devsim; found from devsim's own place
+// first, so a moved build tree still works, then where the build put it.
+std::string SupportLibrary() {
+  std::error_code ec;
+  const auto self = std::filesystem::read_symlink("/proc/self/exe", ec);
+  if (!ec) {
+    const auto beside = self.parent_path().parent_path() / "platform" / "FaultkeepSupport";
+    if (std::filesystem::exists(beside, ec)) return beside.string();
+  }
+  return FAULTKEEP_SUPPORT_LIBRARY;
+}
+
+}  // namespace
+
 int main(int argc, char** argv) {
   CLI::App app{"Simulated device tools"};
   app.require_subcommand(1);
@@ -35,7 +51,7 @@ int main(int argc, char** argv) {
       return 2;
     }
     std::string error;
-    if (!WriteDefaultRoot(std::filesystem::absolute(dir).string(), &error)) {
+    if (!WriteDefaultRoot(std::filesystem::absolute(dir).string(), SupportLibrary(), &error)) {
       std::fprintf(stderr, "devsim: %s\n", error.c_str());
       return 1;
     }

@@ -1,0 +1,181 @@
+#include "platform/system.h"
+
+#include <errno.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+
+#include "platform/clock.h"
+#include "platform/context.h"
+#include "platform/files.h"
+#include "platform/log.h"
+#include "platform/profile.h"
+
+cf::Value _CFCopySystemVersionDictionary() {
+  cf::Dictionary profile = platform::ReadProfileDictionary("/device/system-version.plist");
+  if (!profile.empty()) return profile;
+  auto release = platform::ReadOsRelease();
+  cf::Dictionary d;
+  if (!release["NAME"].empty()) d.Set("ProductName", release["NAME"]);
+  if (!release["VERSION_ID"].empty()) d.Set("ProductVersion", release["VERSION_ID"]);
+  const std::string build = !release["BUILD_ID"].empty() ? release["BUILD_ID"] : release["VERSION_ID"];
+  if (!build.empty()) d.Set("ProductBuildVersion", build);
+  return d;
+}
+
+namespace platform {
+namespace {
+
+int Fail(int error) {
+  errno = error;
+  return -1;
+}
+
+int CopyOut(const void* bytes, size_t n, void* buffer, size_t* size) {
+  if (*size != n) return Fail(ENOMEM);
+  std::memcpy(buffer, bytes, n);
+  return 0;
+}
+
+// The swap total of /proc/meminfo, in bytes.
+bool SwapTotal(uint64_t* bytes) {
+  const auto text = ReadFile("/proc/meminfo");
+  if (!text) return false;
+  const size_t at = text->find("SwapTotal:");
+  if (at == std::string::npos) return false;
+  *bytes = std::strtoull(text->c_str() + at + 10, nullptr, 10) * 1024;
+  return true;
+}
+
+}  // namespace
+
+int Sysctl(const char* name, void* buffer, size_t* size) {
+  if (!name || !buffer || !size) return Fail(EINVAL);
+  const cf::Dictionary profile = ReadProfileDictionary("/device/sysctl.plist");
+  const cf::Value& v = profile.Get(name);
+  if (const cf::Number* n = v.AsNumber()) {
+    const uint64_t value = n->AsUInt64();
+    if (*size == 8) return CopyOut(&value, 8, buffer, size);
+    if (*size == 4 && value <= UINT32_MAX) {
+      const uint32_t narrow = static_cast<uint32_t>(value);
+      return CopyOut(&narrow, 4, buffer, size);
+    }
+    return Fail(ENOMEM);
+  }
+  if (const cf::Data* d = v.AsData()) return CopyOut(d->data(), d->size(), buffer, size);
+  if (!v.IsNull()) return Fail(EINVAL);
+
+  const std::string key = name;
+  if (key == "vm.swapusage") {
+    // {total, available, used, flags}: only the total is known here.
+    uint64_t record[4] = {0, 0, 0, 0};
+    if (!SwapTotal(&record[0])) return Fail(ENOENT);
+    return CopyOut(record, sizeof record, buffer, size);
+  }
+  if (key == "kern.bootsessionuuid") {
+    auto id = ReadFile("/proc/sys/kernel/random/boot_id");
+    if (!id) return Fail(ENOENT);
+    while (!id->empty() && (id->back() == '\n' || id->back() == ' ')) id->pop_back();
+    const std::string text = *id + '\0';
+    return CopyOut(text.data(), text.size(), buffer, size);
+  }
+  return Fail(ENOENT);
+}
+
+uint64_t PageSize() {
+  const long n = sysconf(_SC_PAGESIZE);
+  return n > 0 ? static_cast<uint64_t>(n) : 4096;
+}
+
+}  // namespace platform
+
+uint64_t mach_absolute_time() { return platform::MonotonicNanos(); }
+
+int mach_timebase_info(mach_timebase_info_data_t* info) {
+  if (!info) return 4;  // an invalid argument, as the kernel would say
+  return platform::Context::Current().clock().Timebase(&info->numer, &info->denom) ? 0 : 5;
+}
+
+LSApplicationWorkspace& LSApplicationWorkspace::defaultWorkspace() {
+  static LSApplicationWorkspace workspace;
+  return workspace;
+}
+
+void LSApplicationWorkspace::enumerateBundlesOfType(int type, const std::function<void(const LSBundleProxy&)>& block) {
+  if (type != 1) return;
+  const cf::Value apps = platform::ReadProfileValue("/device/apps.plist");
+  const cf::Array* list = apps.AsArray();
+  if (!list) return;
+  for (const cf::Value& app : *list) {
+    const cf::Dictionary* d = app.AsDictionary();
+    if (!d) continue;
+    LSBundleProxy proxy;
+    if (auto id = d->Get("bundleIdentifier").AsString()) proxy.bundleIdentifier = *id;
+    if (auto kind = d->Get("bundleType").AsString()) proxy.bundleType = *kind;
+    block(proxy);
+  }
+}
+
+namespace {
+
+// "en_US.UTF-8@euro" -> "en-US"; nothing for C and POSIX.
+std::string LanguageTag(std::string locale) {
+  locale = locale.substr(0, locale.find_first_of(".@"));
+  if (locale.empty() || locale == "C" || locale == "POSIX") return {};
+  for (char& c : locale)
+    if (c == '_') c = '-';
+  return locale;
+}
+
+std::string LanguageOf(const std::string& tag) { return tag.substr(0, tag.find('-')); }
+
+}  // namespace
+
+cf::Array preferredLanguages() {
+  cf::Array out;
+  const std::string language = platform::EnvOr("LANGUAGE", "");
+  if (!language.empty()) {
+    size_t start = 0;
+    while (start <= language.size()) {
+      size_t end = language.find(':', start);
+      if (end == std::string::npos) end = language.size();
+      const std::string tag = LanguageTag(language.substr(start, end - start));
+      if (!tag.empty()) out.Append(tag);
+      start = end + 1;
+    }
+    if (!out.empty()) return out;
+  }
+  const std::string tag = LanguageTag(platform::EnvOr("LANG", ""));
+  if (!tag.empty()) out.Append(tag);
+  return out;
+}
+
+cf::Array systemLanguages() {
+  const cf::Value v = platform::ReadProfileDictionary("/device/answers.plist").Get("SystemLanguages");
+  cf::Array out;
+  if (const cf::Array* a = v.AsArray())
+    for (const cf::Value& item : *a)
+      if (item.AsString()) out.Append(item);
+  if (out.empty()) out.Append("en");
+  return out;
+}
+
+cf::Array preferredLocalizationsFromArray(const cf::Array& available, const cf::Array& preferences) {
+  for (const cf::Value& pref : preferences) {
+    const std::string* p = pref.AsString();
+    if (!p) continue;
+    for (const cf::Value& a : available)
+      if (a.AsString() && *a.AsString() == *p) return cf::Array({a});
+    for (const cf::Value& a : available)
+      if (a.AsString() && LanguageOf(*a.AsString()) == LanguageOf(*p)) return cf::Array({a});
+  }
+  return cf::Array();
+}
+
+cf::Value CurrentLocaleCountryCode() {
+  const std::string tag = LanguageTag(platform::EnvOr("LANG", ""));
+  const size_t dash = tag.find('-');
+  if (dash == std::string::npos || dash + 1 >= tag.size()) return {};
+  return tag.substr(dash + 1);
+}
