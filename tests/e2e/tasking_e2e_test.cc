@@ -117,6 +117,17 @@ TEST_F(Tasking, IdentifierWithoutPayloadPostsEveryRunAndBadEntriesAreSkipped) {
   EXPECT_EQ(Count(r.err, "<error>: Skipping a tasking entry without Key or Domain: {"), 1u);
   EXPECT_EQ(PrefIn("Library/Preferences/com.velmora.da.plist", "Network"), cf::Value::Bool(true));
   EXPECT_EQ(Notifications(), 3u);
+
+  // Applied, then a tasking without payload: the old entries go, and so does
+  // the stored tasking (back to none), with a notification.
+  Schedule("T11", cf::Value());
+  const RunResult withdraw = Tallyrun({"-f"});
+  EXPECT_EQ(Count(withdraw.err, "Tasking update (T10 -> T11, 22C41 -> 22C41)"), 1u);
+  EXPECT_TRUE(PrefIn("Library/Preferences/com.velmora.da.plist", "Network").IsNull());
+  EXPECT_TRUE(Pref("TaskingID").IsNull());
+  EXPECT_TRUE(Pref("TaskingPayload").IsNull());
+  EXPECT_EQ(Pref("TaskingOS"), cf::Value("22C41"));  // left in place
+  EXPECT_EQ(Notifications(), 4u);
 }
 
 TEST_F(Tasking, AGroupSwitchedOffByTaskingLeavesTheReportAndComesBack) {
