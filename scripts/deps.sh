@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Installs the Debian packages this project needs that the machine lacks.
 set -euo pipefail
-packages=(cmake ninja-build g++ clang pkg-config sqlite3 libsqlite3-dev libplist-dev libplist-utils
+packages=(cmake ninja-build g++ clang libclang-rt-14-dev pkg-config sqlite3 libsqlite3-dev libplist-dev libplist-utils
   nlohmann-json3-dev libssl-dev libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev)
 missing=()
 for p in "${packages[@]}"; do

@@ -1,12 +1,23 @@
 #!/usr/bin/env bash
-# Builds everything (warnings are errors) and runs every test; then the same
-# tests once more under the address and undefined-behaviour sanitizers.
+# Builds everything (warnings are errors) and runs every test; builds the
+# fuzz targets with clang and replays their seed corpora; then runs the tests
+# once more under the address and undefined-behaviour sanitizers.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 bash scripts/deps.sh
 cmake -S . -B build -G Ninja -DTALLYRUN_WERROR=ON
 cmake --build build
 ctest --test-dir build --output-on-failure -j2
+
+CXX=clang++ CC=clang cmake -S . -B build-fuzz -G Ninja -DTALLYRUN_FUZZ=ON -DTALLYRUN_BENCH=OFF -DTALLYRUN_WERROR=ON
+cmake --build build-fuzz --target fuzz_all
+rm -rf build-fuzz/corpus
+build-fuzz/fuzz/fuzz_seeds build-fuzz/corpus
+for target in ftl stats msp snapshot snapshot_inplace plist; do
+  echo "replaying the $target corpus"
+  build-fuzz/fuzz/fuzz_$target build-fuzz/corpus/$target -runs=0
+done
+
 cmake -S . -B build-asan -G Ninja -DTALLYRUN_WERROR=ON -DTALLYRUN_SANITIZE=ON -DTALLYRUN_BENCH=OFF \
   -DCMAKE_BUILD_TYPE=Debug
 cmake --build build-asan

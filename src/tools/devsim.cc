@@ -2,13 +2,78 @@
 // default device root.
 #include <CLI/CLI.hpp>
 
+#include <algorithm>
 #include <cstdio>
+#include <cstring>
+#include <vector>
 #include <filesystem>
 #include <string>
 
+#include "parsers/parsers.h"
+#include "platform/files.h"
 #include "tools/default_root.h"
 
 namespace {
+
+constexpr int kBadInput = 2;
+
+bool ReadInput(const std::string& path, std::string* bytes) {
+  std::string error;
+  auto content = platform::ReadFile(path, &error);
+  if (!content) {
+    std::fprintf(stderr, "devsim: %s\n", error.c_str());
+    return false;
+  }
+  if (content->size() > UINT32_MAX) {
+    std::fprintf(stderr, "devsim: %s is larger than 4 GiB\n", path.c_str());
+    return false;
+  }
+  *bytes = std::move(*content);
+  return true;
+}
+
+// One "name value" line per pair, then the parser's result and the message
+// it recorded, if any.
+int Parse(const std::string& kind, const std::string& file) {
+  std::string bytes;
+  if (!ReadInput(file, &bytes)) return kBadInput;
+  const auto size = static_cast<uint32_t>(bytes.size());
+  VSPParseCxt stats;
+  GenericParserCxt generic;
+  uint32_t result = 0;
+  if (kind == "ftl") result = VSPFTLParseBufferToCxt(&generic, bytes.data(), size);
+  else if (kind == "stats") result = VSPParseBufferToCxt(&stats, bytes.data(), size);
+  else result = VSPMSPParseBufferToCxt(&generic, bytes.data(), size);
+  for (const ParserPair& p : (kind == "stats" ? stats.pairs : generic.pairs))
+    std::printf("%s %s\n", p.name.c_str(), ParserPairValueText(p).c_str());
+  std::printf("result %u\n", result);
+  if (HasAPIErrorMessage()) std::printf("error: %s\n", GetAPIErrorMessage().c_str());
+  return 0;
+}
+
+int Snapshot(const std::string& file, const std::string& header_file) {
+  std::string data, header;
+  if (!ReadInput(file, &data) || (!header_file.empty() && !ReadInput(header_file, &header))) return kBadInput;
+  if (header_file.empty()) {
+    std::vector<char> out(4096 + data.size() * 4);  // a record prints under 1 KiB per 252 bytes
+    uint32_t size = static_cast<uint32_t>(out.size());
+    const int result = VSPParseSnapshotBuffer(data.data(), static_cast<uint32_t>(data.size()), out.data(), &size);
+    std::fwrite(out.data(), 1, result ? size : std::strlen(out.data()), stdout);
+    return result ? 0 : 1;
+  }
+  // Piece by piece, as a caller with a fixed buffer would; room enough for
+  // the preamble, so every call moves on.
+  std::vector<char> out(std::max<size_t>(65536, header.size() + 4096));
+  uint32_t index = 0;
+  for (;;) {
+    uint32_t size = static_cast<uint32_t>(out.size());
+    const int result = VSPParseSnapshotBufferWithInplaceParser(data.data(), static_cast<uint32_t>(data.size()),
+                                                               out.data(), &size, header.data(),
+                                                               static_cast<uint32_t>(header.size()), &index);
+    std::fputs(out.data(), stdout);
+    if (result) return 0;
+  }
+}
 
 // The support library built beside devsim; found from devsim's own place
 // first, so a moved build tree still works, then where the build put it.
@@ -32,6 +97,13 @@ int main(int argc, char** argv) {
   auto* init = app.add_subcommand("init", "Write a complete default device root into DIR");
   init->add_option("DIR", dir)->required();
   init->add_flag("--force", force, "write into a non-empty DIR, replacing the files it writes");
+  std::string kind, file, header_file;
+  auto* parse = app.add_subcommand("parse", "Parse a raw statistics buffer: one 'name value' line per pair");
+  parse->add_option("KIND", kind, "ftl, stats or msp")->required()->check(CLI::IsMember({"ftl", "stats", "msp"}));
+  parse->add_option("FILE", file)->required();
+  auto* snapshot = app.add_subcommand("snapshot", "Print a snapshot buffer as text");
+  snapshot->add_option("FILE", file)->required();
+  snapshot->add_option("--header", header_file, "the snapshot header, for the descriptor-driven form");
   try {
     app.parse(argc, argv);
   } catch (const CLI::CallForHelp& e) {
@@ -40,6 +112,8 @@ int main(int argc, char** argv) {
     app.exit(e);
     return 2;
   }
+  if (parse->parsed()) return Parse(kind, file);
+  if (snapshot->parsed()) return Snapshot(file, header_file);
   if (init->parsed()) {
     std::error_code ec;
     if (std::filesystem::exists(dir, ec) && !std::filesystem::is_directory(dir, ec)) {

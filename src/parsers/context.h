@@ -1,0 +1,86 @@
+// Parser contexts: ordered (name, unsigned 64-bit value) pairs, the
+// operations every statistics parser appends with, and the process-wide
+// last-error message the parsers and the storage service report through.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "cf/format.h"
+
+// One pair. Names are at most 98 characters; names repeat when a key occurs
+// twice in a buffer.
+struct ParserPair {
+  std::string name;
+  uint64_t value;
+};
+
+// The value as the decimal text a context carries beside it ("%llu").
+std::string ParserPairValueText(const ParserPair& pair);
+
+struct GenericParserCxt {
+  std::vector<ParserPair> pairs;  // in the order added
+};
+
+// The full statistics context: the pairs plus well-known counters.
+struct VSPParseCxt : GenericParserCxt {
+  uint32_t exportVersion = 0;
+  uint32_t driverVersion = 0;
+  uint32_t numVirtualBlocks = 0;
+  uint32_t blocksPerVirtualBlock = 0;
+  uint32_t pagesPerVirtualBlock = 0;
+  uint32_t bytesPerPage = 0;
+  uint64_t hostReads = 0;
+  uint64_t hostWrites = 0;
+  uint64_t numFreeVirtualBlocks = 0;
+  uint64_t wearLevMoves = 0;
+  uint64_t nandReads = 0;
+  uint64_t nandWrites = 0;
+  uint64_t bandErases = 0;
+  uint64_t IND_pool_free = 0;
+  uint64_t IND_pool_count = 0;
+  uint64_t utilFormatTime = 0;
+  uint64_t numSleepOps = 0;
+  uint64_t maxHighEnduranceBlockErases = 0;
+  uint64_t readCountHisto[5] = {};
+};
+
+inline constexpr size_t kMaxParserNameLength = 98;
+
+// Appends (prefix + name, cut to 98 characters; value). 1 on success, 0 on
+// failure (a null context, or no memory).
+int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix, const char* name, uint64_t value);
+// Appends count elements of elementSize bytes (each zero-extended to 64
+// bits): one pair under the bare name when count is 1, else name0, name1, ...
+// 1 when every element was added (and when there was nothing to add); 0 for
+// elements wider than 8 bytes or when an add failed.
+int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* name, const void* source,
+                                      uint32_t elementSize, uint32_t count);
+// Frees every pair and empties the context; harmless on an empty context.
+void ReleaseGenericParserCxt(GenericParserCxt* context);
+// Frees the pairs and zero-fills the whole context, fixed fields included.
+void VSPReleaseContext(VSPParseCxt* context);
+
+// Room for the pairs a buffer can yield at most (values never outnumber its
+// words; capped for huge buffers), so appending does not reallocate.
+void ReservePairs(GenericParserCxt& context, uint64_t max_values);
+
+// The first message recorded in the process wins; at most 1023 characters.
+void SetAPIErrorMessageText(std::string_view text);
+bool HasAPIErrorMessage();
+template <typename... A>
+void SetAPIErrorMessage(std::string_view format, const A&... args) {
+  if (!HasAPIErrorMessage()) SetAPIErrorMessageText(cf::Format(format, args...));
+}
+// The recorded message, or "NA" when none was recorded.
+std::string GetAPIErrorMessage();
+
+namespace parsers::testing {
+// Forgets the recorded message, so each test starts as a new process would.
+void ResetAPIErrorMessage();
+// After this many more successful adds, adds fail as with an exhausted heap;
+// -1 (the default) never fails.
+extern int64_t g_adds_before_failure;
+}  // namespace parsers::testing

@@ -1,0 +1,193 @@
+#include <gtest/gtest.h>
+
+#include "parsers/parsers.h"
+#include "sim/statistics_buffers.h"
+
+namespace {
+
+using sim::WordRecordBuffer;
+
+class FtlTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    parsers::testing::ResetAPIErrorMessage();
+    parsers::testing::g_adds_before_failure = -1;
+  }
+  void TearDown() override { parsers::testing::g_adds_before_failure = -1; }
+  static std::vector<std::string> Names(const GenericParserCxt& c) {
+    std::vector<std::string> out;
+    for (const auto& p : c.pairs) out.push_back(p.name);
+    return out;
+  }
+  static uint32_t Ftl(GenericParserCxt& c, const WordRecordBuffer& b) {
+    return VSPFTLParseBufferToCxt(&c, b.bytes().data(), b.size());
+  }
+  static uint32_t Stats(VSPParseCxt& c, const WordRecordBuffer& b) {
+    return VSPParseBufferToCxt(&c, b.bytes().data(), b.size());
+  }
+};
+
+TEST_F(FtlTest, CompleteBufferYieldsEveryValue) {
+  const std::string buffer = sim::CompleteFtlBuffer();
+  GenericParserCxt c;
+  EXPECT_EQ(VSPFTLParseBufferToCxt(&c, buffer.data(), static_cast<uint32_t>(buffer.size())), 2156u);
+  ASSERT_EQ(c.pairs.size(), 2156u);
+  EXPECT_EQ(c.pairs[0].name, "version");
+  EXPECT_EQ(c.pairs[0].value, 1000u);
+  EXPECT_EQ(GetAPIErrorMessage(), "NA");
+  VSPParseCxt s;
+  // The full statistics parse has no end marker: the marker's record is just
+  // skipped, and the buffer ends exactly after it.
+  EXPECT_EQ(VSPParseBufferToCxt(&s, buffer.data(), static_cast<uint32_t>(buffer.size())), 1u);
+  EXPECT_EQ(s.pairs.size(), 2156u);
+  EXPECT_EQ(s.driverVersion, 0xFFFFFFFFu);
+  VSPReleaseContext(&s);
+  EXPECT_TRUE(s.pairs.empty());
+  EXPECT_EQ(s.driverVersion, 0u);
+}
+
+TEST_F(FtlTest, EndRulesAndSkipping) {
+  GenericParserCxt c;
+  // Zero-length record, a scalar, an unknown key, the end marker, then a
+  // record that must not be read.
+  WordRecordBuffer b;
+  b.Header(2, 0).Record(2, {7, 99}).Record(21, {5, 5}).Record(700, {1}).Record(0xFFFF, {0}).Record(3, {8});
+  EXPECT_EQ(Ftl(c, b), 1u);
+  EXPECT_EQ(Names(c), (std::vector<std::string>{"hostWriteXacts"}));
+  EXPECT_EQ(c.pairs[0].value, 7u);  // further payload words are ignored
+
+  // A key above 0x30000000 ends both parses; a truncated record too.
+  c = {};
+  WordRecordBuffer bad;
+  bad.Record(2, {1}).Record(0x30000001, {1}).Record(3, {2});
+  EXPECT_EQ(Ftl(c, bad), 1u);
+  VSPParseCxt s;
+  s.exportVersion = 9;
+  EXPECT_EQ(Stats(s, bad), 0u);
+  EXPECT_EQ(s.exportVersion, 0u);
+  c = {};
+  WordRecordBuffer truncated;
+  truncated.Record(2, {1}).Header(3, 2).Word(5);
+  EXPECT_EQ(Ftl(c, truncated), 1u);
+  VSPParseCxt t;
+  EXPECT_EQ(Stats(t, truncated), 0u);
+  EXPECT_EQ(GetAPIErrorMessage(), "NA");  // ending on a bad record is quiet
+
+  // Fewer than 8 bytes.
+  c = {};
+  EXPECT_EQ(VSPFTLParseBufferToCxt(&c, "1234567", 7), 0u);
+  VSPParseCxt small;
+  small.exportVersion = 5;
+  EXPECT_EQ(VSPParseBufferToCxt(&small, "1234567", 7), 0u);
+  EXPECT_EQ(small.exportVersion, 5u);
+  EXPECT_EQ(small.driverVersion, 0xFFFFFFFFu);
+  EXPECT_EQ(VSPFTLParseBufferToCxt(&c, nullptr, 64), 0u);
+
+  // Exactly filled gives 1; four stray bytes are ignored; one word short gives 0.
+  WordRecordBuffer exact;
+  exact.Record(4, {10}).Record(7, {20});
+  VSPParseCxt e;
+  EXPECT_EQ(Stats(e, exact), 1u);
+  EXPECT_EQ(e.hostWrites, 10u);
+  EXPECT_EQ(e.hostReads, 20u);
+  WordRecordBuffer stray = exact;
+  stray.Bytes("abcd");
+  VSPParseCxt st;
+  EXPECT_EQ(Stats(st, stray), 1u);
+  WordRecordBuffer short_one;
+  short_one.Record(4, {10}).Header(7, 2).Word(1);
+  VSPParseCxt sh;
+  EXPECT_EQ(Stats(sh, short_one), 0u);
+  EXPECT_EQ(sh.hostWrites, 10u);  // what was parsed stays
+}
+
+TEST_F(FtlTest, ArraysNamesAndMismatchMessages) {
+  GenericParserCxt c;
+  WordRecordBuffer shorter;
+  shorter.Record(14, {0, 1, 2, 3, 4, 5, 6});
+  EXPECT_EQ(Ftl(c, shorter), 7u);
+  EXPECT_EQ(Names(c).front(), "hostWriteLogHisto_0");
+  EXPECT_EQ(Names(c).back(), "hostWriteLogHisto_6");
+  EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): (#10) cfg elements != (7) buffer elements");
+
+  parsers::testing::ResetAPIErrorMessage();
+  c = {};
+  WordRecordBuffer longer;
+  longer.Record(14, {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11}).Record(2, {42});
+  EXPECT_EQ(Ftl(c, longer), 11u);  // ten elements, then the scalar after all twelve words
+  EXPECT_EQ(c.pairs.back().name, "hostWriteXacts");
+  EXPECT_EQ(c.pairs.back().value, 42u);
+  EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): (#10) cfg elements != (12) buffer elements");
+
+  // One word: the bare name, "_" included for the FTL parse, not for stats.
+  c = {};
+  WordRecordBuffer single;
+  single.Record(14, {5});
+  EXPECT_EQ(Ftl(c, single), 1u);
+  EXPECT_EQ(Names(c), (std::vector<std::string>{"hostWriteLogHisto_"}));
+  VSPParseCxt s;
+  EXPECT_EQ(Stats(s, single), 1u);
+  EXPECT_EQ(Names(s), (std::vector<std::string>{"hostWriteLogHisto"}));
+
+  // Stats names run on without "_"; key 265 fills readCountHisto.
+  WordRecordBuffer stats;
+  stats.Record(269, {1, 2}).Record(265, {10, 11, 12, 13, 14}).Record(53, {(1ull << 32) + 2});
+  VSPParseCxt full;
+  EXPECT_EQ(Stats(full, stats), 1u);
+  EXPECT_EQ(Names(full)[0], "numBootBlockRefreshSuccess0");
+  EXPECT_EQ(Names(full)[1], "numBootBlockRefreshSuccess1");
+  EXPECT_EQ(Names(full)[6], "readCountHisto4");
+  EXPECT_EQ(full.readCountHisto[0], 10u);
+  EXPECT_EQ(full.readCountHisto[4], 14u);
+  EXPECT_EQ(full.exportVersion, 2u);  // the low 32 bits
+  EXPECT_EQ(full.pairs.back().name, "exportVersion");
+  EXPECT_EQ(full.pairs.back().value, 4294967298u);
+  EXPECT_EQ(ParserPairValueText(full.pairs.back()), "4294967298");
+}
+
+TEST_F(FtlTest, AddFailures) {
+  GenericParserCxt c;
+  WordRecordBuffer b;
+  b.Record(1, {1}).Record(2, {2}).Record(14, {1, 2, 3}).Record(3, {3});
+  parsers::testing::g_adds_before_failure = 0;
+  // A failed scalar still counts and the walk goes on; a failed array stops it.
+  EXPECT_EQ(Ftl(c, b), 2u);
+  EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: version(1) cannot add 1 element to context");
+  parsers::testing::ResetAPIErrorMessage();
+  parsers::testing::g_adds_before_failure = 2;
+  c = {};
+  WordRecordBuffer arrays;
+  arrays.Record(14, std::vector<uint64_t>(10, 1)).Record(2, {2});
+  EXPECT_EQ(Ftl(c, arrays), 0u);
+  EXPECT_EQ(c.pairs.size(), 2u);  // what was added before the failure stays
+  EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): Cannot add 10 elements to context");
+  // The first message of the process wins.
+  SetAPIErrorMessage("later %d", 1);
+  EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): Cannot add 10 elements to context");
+}
+
+TEST_F(FtlTest, ContextOperations) {
+  GenericParserCxt c;
+  EXPECT_EQ(AddSingleValueToGenericContext(nullptr, "", "x", 1), 0);
+  EXPECT_EQ(AddSingleValueToGenericContext(&c, "pre_", std::string(200, 'n').c_str(), 5), 1);
+  EXPECT_EQ(c.pairs[0].name.size(), 98u);
+  EXPECT_EQ(c.pairs[0].name.substr(0, 5), "pre_n");
+  EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "dup", 1), 1);
+  EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "dup", 2), 1);
+  EXPECT_EQ(c.pairs.size(), 3u);  // duplicates are kept
+  const uint32_t four[3] = {0xFFFFFFFF, 2, 3};
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "t", four, 4, 3), 1);
+  EXPECT_EQ(c.pairs[3].name, "t0");
+  EXPECT_EQ(c.pairs[3].value, 0xFFFFFFFFu);  // zero-extended
+  EXPECT_EQ(ParserPairValueText(c.pairs[3]), "4294967295");
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 4, 0), 1);
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 0, 3), 1);
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 9, 1), 0);
+  EXPECT_EQ(c.pairs.size(), 6u);
+  ReleaseGenericParserCxt(&c);
+  ReleaseGenericParserCxt(&c);
+  ReleaseGenericParserCxt(nullptr);
+  EXPECT_TRUE(c.pairs.empty());
+}
+
+}  // namespace

@@ -1,0 +1,20 @@
+// The MSP statistics field table.
+#pragma once
+
+#include <cstdint>
+#include <span>
+
+namespace parsers {
+
+struct MspField {
+  uint32_t key;
+  const char* name;
+  uint32_t count;  // 32-bit elements; 1 for a single value
+};
+
+// The row of a record key, or null for a key that carries no field.
+const MspField* FindMspField(uint32_t key);
+// Every row, in key order.
+std::span<const MspField> MspFields();
+
+}  // namespace parsers

@@ -1,0 +1,133 @@
+#include "sim/statistics_buffers.h"
+
+#include <cstring>
+
+#include "parsers/ftl_table.h"
+#include "parsers/msp_table.h"
+
+namespace sim {
+namespace {
+
+template <typename T>
+void Put(std::string& out, T v) {
+  for (size_t i = 0; i < sizeof(T); ++i) out += static_cast<char>((static_cast<uint64_t>(v) >> (8 * i)) & 0xFF);
+}
+
+}  // namespace
+
+WordRecordBuffer& WordRecordBuffer::Record(uint32_t key, const std::vector<uint64_t>& payload) {
+  Header(key, static_cast<uint32_t>(payload.size()));
+  for (uint64_t w : payload) Put(bytes_, w);
+  return *this;
+}
+
+WordRecordBuffer& WordRecordBuffer::Header(uint32_t key, uint32_t length) {
+  return Word(uint64_t{key} | (uint64_t{length} << 32));
+}
+
+WordRecordBuffer& WordRecordBuffer::Word(uint64_t raw) {
+  Put(bytes_, raw);
+  return *this;
+}
+
+WordRecordBuffer& WordRecordBuffer::Bytes(const std::string& raw) {
+  bytes_ += raw;
+  return *this;
+}
+
+ByteRecordBuffer& ByteRecordBuffer::Record(uint16_t key, const std::vector<uint32_t>& elements) {
+  std::string payload;
+  for (uint32_t e : elements) Put(payload, e);
+  return RecordBytes(key, payload);
+}
+
+ByteRecordBuffer& ByteRecordBuffer::RecordBytes(uint16_t key, const std::string& payload) {
+  Header(key, static_cast<uint16_t>(payload.size()));
+  bytes_ += payload;
+  return *this;
+}
+
+ByteRecordBuffer& ByteRecordBuffer::Header(uint16_t key, uint16_t length) {
+  Put(bytes_, key);
+  Put(bytes_, length);
+  return *this;
+}
+
+ByteRecordBuffer& ByteRecordBuffer::Bytes(const std::string& raw) {
+  bytes_ += raw;
+  return *this;
+}
+
+SnapshotBuilder& SnapshotBuilder::Field(uint16_t type, uint32_t offset, uint32_t size, const std::string& format) {
+  fields_.push_back({type, offset, size, format.substr(0, 15)});
+  return *this;
+}
+
+SnapshotBuilder& SnapshotBuilder::Record(const std::vector<uint32_t>& words) {
+  std::string record;
+  for (uint32_t w : words) Put(record, w);
+  record.resize(entry_size_, '\0');
+  data_ += record;
+  ++records_;
+  return *this;
+}
+
+std::string SnapshotBuilder::Header() const {
+  // Fixed part (36 bytes), the legend, then the descriptor table.
+  std::string legend = version_ >= 6 ? legend_ + '\0' : std::string();
+  const uint32_t table = static_cast<uint32_t>(36 + legend.size());
+  std::string h;
+  Put(h, uint32_t{0x534E4150});  // not read
+  Put(h, version_);
+  Put(h, entry_size_);
+  Put(h, claimed_count_ >= 0 ? static_cast<uint32_t>(claimed_count_) : records_);
+  Put(h, uint32_t{0});
+  Put(h, uint32_t{0});
+  Put(h, table);
+  Put(h, uint32_t{0});
+  Put(h, uint32_t{0});
+  h += legend;
+  Put(h, static_cast<uint32_t>(fields_.size()));
+  Put(h, uint32_t{0});
+  for (const Desc& d : fields_) {
+    Put(h, d.type);
+    Put(h, uint16_t{0});
+    Put(h, d.offset);
+    Put(h, d.size);
+    std::string format = d.format;
+    format.resize(16, '\0');
+    h += format;
+  }
+  return h;
+}
+
+std::string FixedSnapshotRecord(const std::vector<uint32_t>& words) {
+  std::string record;
+  for (uint32_t w : words) Put(record, w);
+  record.resize(63 * 4, '\0');
+  return record;
+}
+
+std::string CompleteFtlBuffer() {
+  WordRecordBuffer b;
+  uint64_t v = 1000;
+  for (const parsers::FtlField& f : parsers::FtlFields()) {
+    std::vector<uint64_t> payload(f.is_array() ? f.count : 1);
+    for (uint64_t& w : payload) w = v++;
+    b.Record(f.key, payload);
+  }
+  return b.End().bytes();
+}
+
+std::string CompleteMspBuffer() {
+  ByteRecordBuffer b;
+  uint32_t v = 1;
+  for (const parsers::MspField& f : parsers::MspFields()) {
+    std::vector<uint32_t> elements(f.count);
+    for (uint32_t& e : elements) e = v++;
+    b.Record(static_cast<uint16_t>(f.key), elements);
+  }
+  return b.End().bytes();
+}
+
+}  // namespace sim
