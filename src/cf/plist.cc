@@ -411,13 +411,6 @@ std::string Base64Encode(const Data& d) {
   return out;
 }
 
-std::string ISO8601(const Date& d) {
-  const time_t secs = static_cast<time_t>(std::floor(d.seconds));
-  struct tm tm;
-  gmtime_r(&secs, &tm);
-  char buf[32];
-  std::strftime(buf, sizeof buf, "%Y-%m-%dT%H:%M:%SZ", &tm);
-  return buf;
-}
+std::string ISO8601(const Date& d) { return FormatUTC(d, "%Y-%m-%dT%H:%M:%SZ"); }
 
 }  // namespace cf

@@ -378,14 +378,16 @@ size_t Value::Hash() const {
   return 0;
 }
 
-std::string DateDescription(const Date& d) {
+std::string FormatUTC(const Date& d, const char* format) {
   const time_t secs = static_cast<time_t>(std::floor(d.seconds));
   struct tm tm;
   gmtime_r(&secs, &tm);
   char buf[64];
-  std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+  std::strftime(buf, sizeof buf, format, &tm);
   return buf;
 }
+
+std::string DateDescription(const Date& d) { return FormatUTC(d, "%Y-%m-%d %H:%M:%S +0000"); }
 
 namespace {
 

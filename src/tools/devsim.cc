@@ -1,6 +1,5 @@
 // devsim: the simulated device's tools. `devsim init DIR` writes a complete
 // default device root.
-#include <CLI/CLI.hpp>
 
 #include <algorithm>
 #include <cstdio>
@@ -10,6 +9,7 @@
 #include <string>
 
 #include "parsers/parsers.h"
+#include "tools/cli.h"
 #include "platform/files.h"
 #include "tools/default_root.h"
 
@@ -104,14 +104,7 @@ int main(int argc, char** argv) {
   auto* snapshot = app.add_subcommand("snapshot", "Print a snapshot buffer as text");
   snapshot->add_option("FILE", file)->required();
   snapshot->add_option("--header", header_file, "the snapshot header, for the descriptor-driven form");
-  try {
-    app.parse(argc, argv);
-  } catch (const CLI::CallForHelp& e) {
-    return app.exit(e);
-  } catch (const CLI::ParseError& e) {
-    app.exit(e);
-    return 2;
-  }
+  if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
   if (parse->parsed()) return Parse(kind, file);
   if (snapshot->parsed()) return Snapshot(file, header_file);
   if (init->parsed()) {

@@ -1,6 +1,5 @@
 // tallybook: read and write the statistics store of the device root
 // (TALLYRUN_ROOT) by hand.
-#include <CLI/CLI.hpp>
 
 #include <charconv>
 #include <cmath>
@@ -8,6 +7,7 @@
 #include <limits>
 #include <string>
 
+#include "tools/cli.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/history.h"
@@ -108,14 +108,7 @@ int main(int argc, char** argv) {
   dump->add_option("--prefix", prefix, "only keys starting with this");
   auto* today = app.add_subcommand("today", "Print today's day number");
 
-  try {
-    app.parse(argc, argv);
-  } catch (const CLI::CallForHelp& e) {
-    return app.exit(e);
-  } catch (const CLI::ParseError& e) {
-    app.exit(e);
-    return kBadInput;
-  }
+  if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
 
   if (today->parsed()) {
     std::printf("%d\n", TBDaysSince1970());

@@ -1,11 +1,11 @@
 // tallyctl: sends one message to the tallyrun service of TALLYRUN_ROOT.
-#include <CLI/CLI.hpp>
 
 #include <cstdio>
 #include <limits>
 #include <string>
 
 #include "cf/plist.h"
+#include "tools/cli.h"
 #include "platform/files.h"
 #include "platform/service.h"
 
@@ -85,14 +85,7 @@ int main(int argc, char** argv) {
   auto* send = app.add_subcommand("send", "Send any operation code");
   send->add_option("OPERATION", operation)->required();
   auto* value_opt = send->add_option("--value", value, "the message's \"value\"");
-  try {
-    app.parse(argc, argv);
-  } catch (const CLI::CallForHelp& e) {
-    return app.exit(e);
-  } catch (const CLI::ParseError& e) {
-    app.exit(e);
-    return 2;
-  }
+  if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
 
   cf::Dictionary message;
   if (logging->parsed()) {
