@@ -295,8 +295,6 @@ bool WriteXMLPropertyList(const Value& v, std::string& out, std::string* error) 
     return false;
   }
   out = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-        "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
-        "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
         "<plist version=\"1.0\">\n" +
         body + "</plist>\n";
   return true;

@@ -35,8 +35,6 @@ TEST(PlistTest, XmlWriteIsExactAndRoundTripsThroughBothReaders) {
   ASSERT_TRUE(WriteXMLPropertyList(d, xml, &error)) << error;
   EXPECT_EQ(xml,
             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-            "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" "
-            "\"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
             "<plist version=\"1.0\">\n<dict>\n\t<key>TBCrashLogVersion</key>\n\t<integer>1</integer>\n"
             "\t<key>x</key>\n\t<real>2.5</real>\n\t<key>empty</key>\n\t<array/>\n</dict>\n</plist>\n");
 
