@@ -36,7 +36,11 @@ Preferences::Domain* Preferences::Load(std::string_view domain) {
   const std::string path = PathFor(domain);
   struct stat st;
   if (stat(path.c_str(), &st) != 0) {
-    if (d.size != -1 || d.mtime_ns != -1) d = Domain{{}, -1, -1, 0, false, d.pending};
+    // No file (any more): nothing on disk; pending changes stay pending.
+    d.on_disk = cf::Dictionary();
+    d.mtime_ns = d.size = -1;
+    d.inode = 0;
+    d.bad_file_reported = false;
     return &d;
   }
   const int64_t mtime = static_cast<int64_t>(st.st_mtim.tv_sec) * 1000000000 + st.st_mtim.tv_nsec;
