@@ -82,6 +82,17 @@ TEST_F(TallyrunTest, ForceTodayAndArguments) {
   EXPECT_EQ(Tallyrun({""}).status, 0);
 }
 
+TEST_F(TallyrunTest, DebugLinesOnlyWhenAskedFor) {
+  RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "<debug>"), 0u);
+  env["TALLYRUN_LOG_DEBUG"] = "1";
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "<debug>: prefix match com.velmora.wifi. for com.velmora.wifi.JoinFailures\n"), 1u);
+  EXPECT_EQ(Count(r.err, "<debug>: Treating key com.velmora.net.DNSLatencyMs as a histogram\n"), 1u);
+  env.erase("TALLYRUN_LOG_STDERR");  // syslog only: nothing on stderr
+  EXPECT_EQ(Tallyrun({"-f"}).err, "");
+}
+
 TEST_F(TallyrunTest, NoLogWithoutSubmissionOrWhitelistedData) {
   cf::Dictionary answers;
   answers.Set("DiagnosticLogSubmissionEnabled", cf::Value::Bool(false));
