@@ -67,21 +67,19 @@ bool FromPlist(plist_t node, int depth, Value& out, std::string& error) {
       out = Number::Float64(d);
       return true;
     }
-    case PLIST_STRING:
-    case PLIST_KEY: {
-      char* s = nullptr;
-      if (plist_get_node_type(node) == PLIST_STRING) plist_get_string_val(node, &s);
-      else plist_get_key_val(node, &s);
-      out = std::string(s ? s : "");
-      free(s);
+    case PLIST_STRING: {
+      // By pointer and length: the copying getter aborts on text with a NUL
+      // inside. The reader keeps nothing after such a NUL, so neither do we.
+      uint64_t length = 0;
+      const char* text = plist_get_string_ptr(node, &length);
+      out = text ? std::string(text, strnlen(text, length)) : std::string();
       return true;
     }
     case PLIST_DATA: {
-      char* d = nullptr;
-      uint64_t len = 0;
-      plist_get_data_val(node, &d, &len);
-      out = Value::Bytes(Data(reinterpret_cast<uint8_t*>(d), reinterpret_cast<uint8_t*>(d) + (d ? len : 0)));
-      free(d);
+      uint64_t length = 0;
+      const char* bytes = plist_get_data_ptr(node, &length);
+      const auto* begin = reinterpret_cast<const uint8_t*>(bytes);
+      out = Value::Bytes(bytes ? Data(begin, begin + length) : Data());
       return true;
     }
     case PLIST_DATE: {

@@ -101,6 +101,12 @@ TEST(PlistTest, MalformedInputGivesAnErrorNotACrash) {
     EXPECT_FALSE(r.ok()) << c;
     EXPECT_TRUE(r.value.IsNull());
   }
+  // Text with a NUL inside (which aborted inside the reader once) ends at the NUL.
+  const char with_nul[] = "<plist version=\"1.0\"><dict><key>k</key><string>x\0y</string></dict></plist>";
+  const ParseResult nul = ParsePropertyList(std::string_view(with_nul, sizeof with_nul - 1));
+  ASSERT_TRUE(nul.ok()) << nul.error;
+  EXPECT_EQ(nul.value.AsDictionary()->Get("k"), Value("x"));
+
   std::string deep = "<plist version=\"1.0\">";
   for (int i = 0; i < 5000; ++i) deep += "<array>";
   for (int i = 0; i < 5000; ++i) deep += "</array>";
