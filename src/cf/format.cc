@@ -1,6 +1,8 @@
 #include "cf/format.h"
 
 #include <cstdio>
+#include <algorithm>
+#include <climits>
 #include <cstring>
 
 namespace cf {
@@ -126,32 +128,34 @@ std::string FormatV(std::string_view fmt, const FormatArg* args, size_t count) {
       i = close + 1;
     }
     std::string flags;
-    while (i < fmt.size() && std::strchr("-+ #0'", fmt[i])) flags += fmt[i++];
+    while (i < fmt.size() && fmt[i] != '\0' && std::strchr("-+ #0'", fmt[i])) flags += fmt[i++];
     int width = -1, precision = -1;
+    // Widths and precisions are bounded, whether written in the format or
+    // taken from an argument, so no input can make one text huge.
+    constexpr int64_t kMaxWidth = 4096;
     if (i < fmt.size() && fmt[i] == '*') {
-      width = static_cast<int>(take().AsSigned());
-      if (width < 0) {
-        flags += '-';
-        width = -width;
-      }
+      const int64_t w = take().AsSigned();
+      if (w < 0) flags += '-';
+      width = static_cast<int>(std::min<int64_t>(w < 0 ? (w == INT64_MIN ? kMaxWidth : -w) : w, kMaxWidth));
       ++i;
     } else {
       while (i < fmt.size() && fmt[i] >= '0' && fmt[i] <= '9')
-        width = (width < 0 ? 0 : width) * 10 + (fmt[i++] - '0'), width = std::min(width, 4096);
+        width = static_cast<int>(std::min<int64_t>((width < 0 ? 0 : width) * 10 + (fmt[i++] - '0'), kMaxWidth));
     }
     if (i < fmt.size() && fmt[i] == '.') {
       ++i;
       precision = 0;
       if (i < fmt.size() && fmt[i] == '*') {
-        precision = static_cast<int>(take().AsSigned());
+        const int64_t p = take().AsSigned();
+        precision = p < 0 ? -1 : static_cast<int>(std::min<int64_t>(p, kMaxWidth));  // negative: as if absent
         ++i;
       } else {
         while (i < fmt.size() && fmt[i] >= '0' && fmt[i] <= '9')
-          precision = std::min(precision * 10 + (fmt[i++] - '0'), 4096);
+          precision = static_cast<int>(std::min<int64_t>(int64_t{precision} * 10 + (fmt[i++] - '0'), kMaxWidth));
       }
     }
     std::string length;
-    while (i < fmt.size() && std::strchr("hlqjztL", fmt[i])) length += fmt[i++];
+    while (i < fmt.size() && fmt[i] != '\0' && std::strchr("hlqjztL", fmt[i])) length += fmt[i++];
     if (i >= fmt.size()) {
       out.append(fmt.substr(start));
       break;

@@ -36,6 +36,10 @@ TEST(FormatTest, ValuesAndOddFormats) {
   EXPECT_EQ(Format("%5@|%-5@|", Value("ab"), Value("cd")), "   ab|cd   |");
   EXPECT_EQ(Format("%.3s", "abcdef"), "abc");
   EXPECT_EQ(Format("%99999d", 1).size(), 4096u);  // widths are bounded
+  EXPECT_EQ(Format("%*u", 1000000000, 7u).size(), 4096u);  // also when they come from an argument
+  EXPECT_EQ(Format("%*u|", INT64_MIN, 7u).size(), 4097u);
+  EXPECT_EQ(Format("%.*s|", -5, "abc"), "abc|");
+  EXPECT_EQ(Format(std::string_view("%\0d", 3), 5), std::string("%\0d", 3));
 }
 
 }  // namespace

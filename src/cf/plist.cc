@@ -11,6 +11,8 @@
 
 namespace cf {
 
+bool ParseBinaryPropertyList(std::string_view bytes, Value& out, std::string& error);
+
 namespace {
 
 // Seconds between 1970-01-01 and the property-list epoch 2001-01-01.
@@ -158,19 +160,23 @@ ParseResult ParsePropertyList(std::string_view bytes) {
     r.error = "property list too large";
     return r;
   }
-  plist_t root = nullptr;
-  const bool binary = bytes.size() >= 8 && std::memcmp(bytes.data(), "bplist00", 8) == 0;
-  if (binary) {
-    plist_from_bin(bytes.data(), static_cast<uint32_t>(bytes.size()), &root);
-  } else {
-    if (!NestingWithinBound(bytes)) {
-      r.error = "property list nested too deeply";
-      return r;
-    }
-    plist_from_xml(bytes.data(), static_cast<uint32_t>(bytes.size()), &root);
+  if (bytes.size() >= 8 && std::memcmp(bytes.data(), "bplist00", 8) == 0) {
+    if (!ParseBinaryPropertyList(bytes, r.value, r.error)) r.value = Value();
+    return r;
   }
+  // XML cannot hold a NUL character; libplist's reader misbehaves on one.
+  if (bytes.find('\0') != std::string_view::npos) {
+    r.error = "malformed XML property list (NUL byte)";
+    return r;
+  }
+  if (!NestingWithinBound(bytes)) {
+    r.error = "property list nested too deeply";
+    return r;
+  }
+  plist_t root = nullptr;
+  plist_from_xml(bytes.data(), static_cast<uint32_t>(bytes.size()), &root);
   if (!root) {
-    r.error = binary ? "malformed binary property list" : "malformed XML property list";
+    r.error = "malformed XML property list";
     return r;
   }
   PlistPtr owner(root);

@@ -101,11 +101,10 @@ TEST(PlistTest, MalformedInputGivesAnErrorNotACrash) {
     EXPECT_FALSE(r.ok()) << c;
     EXPECT_TRUE(r.value.IsNull());
   }
-  // Text with a NUL inside (which aborted inside the reader once) ends at the NUL.
+  // XML cannot hold a NUL (libplist's reader once aborted the process on one).
   const char with_nul[] = "<plist version=\"1.0\"><dict><key>k</key><string>x\0y</string></dict></plist>";
-  const ParseResult nul = ParsePropertyList(std::string_view(with_nul, sizeof with_nul - 1));
-  ASSERT_TRUE(nul.ok()) << nul.error;
-  EXPECT_EQ(nul.value.AsDictionary()->Get("k"), Value("x"));
+  EXPECT_EQ(ParsePropertyList(std::string_view(with_nul, sizeof with_nul - 1)).error,
+            "malformed XML property list (NUL byte)");
 
   std::string deep = "<plist version=\"1.0\">";
   for (int i = 0; i < 5000; ++i) deep += "<array>";
@@ -113,6 +112,62 @@ TEST(PlistTest, MalformedInputGivesAnErrorNotACrash) {
   deep += "</plist>";
   const ParseResult r = ParsePropertyList(deep);
   EXPECT_EQ(r.error, "property list nested too deeply");
+}
+
+// A binary list by hand: objects, offset table, trailer.
+std::string Binary(const std::vector<std::string>& objects, uint64_t top, uint8_t ref_size = 1) {
+  std::string out = "bplist00";
+  std::vector<uint64_t> offsets;
+  for (const std::string& o : objects) {
+    offsets.push_back(out.size());
+    out += o;
+  }
+  const uint64_t table = out.size();
+  for (uint64_t off : offsets) out += static_cast<char>(off);
+  std::string trailer(6, '\0');
+  trailer += static_cast<char>(1);
+  trailer += static_cast<char>(ref_size);
+  auto be = [&](uint64_t v) {
+    for (int i = 7; i >= 0; --i) trailer += static_cast<char>(v >> (8 * i));
+  };
+  be(objects.size());
+  be(top);
+  be(table);
+  return out + trailer;
+}
+
+TEST(PlistTest, BinaryReaderOnHandMadeAndHostileLists) {
+  // {"b\0": "x", "n": -1 (16-byte integer), "big": 2^64-1 (16-byte), "u": UTF-16 "é😀"}
+  const std::string dict = std::string("\xD4\x01\x03\x05\x07\x02\x04\x06\x08", 9);
+  const ParseResult r = ParsePropertyList(Binary(
+      {dict, std::string("\x52" "b\0", 3), "\x51x", "\x51n",
+       std::string("\x14\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff\xff", 17), "\x53" "big",
+       std::string("\x14\0\0\0\0\0\0\0\0\xff\xff\xff\xff\xff\xff\xff\xff", 17), "\x51u",
+       std::string("\x63\x00\xe9\xd8\x3d\xde\x00", 7)},
+      0));
+  ASSERT_TRUE(r.ok()) << r.error;
+  const Dictionary& d = *r.value.AsDictionary();
+  EXPECT_EQ(d.Get(std::string("b\0", 2)), Value("x"));  // a NUL inside a key is kept
+  EXPECT_EQ(d.Get("n"), Value::SInt64(-1));
+  EXPECT_EQ(d.Get("big"), Value::UInt64(UINT64_MAX));
+  EXPECT_EQ(d.Get("u"), Value("\xc3\xa9\xf0\x9f\x98\x80"));
+
+  // An array that contains itself, and a small file describing a huge tree.
+  EXPECT_EQ(ParsePropertyList(Binary({std::string("\xA1\x00", 2)}, 0)).error, "property list nested too deeply");
+  std::vector<std::string> chain;
+  for (int i = 0; i < 40; ++i) chain.push_back(std::string("\xA2", 1) + static_cast<char>(i + 1) + static_cast<char>(i + 1));
+  chain.push_back("\x09");
+  EXPECT_EQ(ParsePropertyList(Binary(chain, 0)).error, "binary property list has too many objects");
+  // Broken trailers and references.
+  const std::string ok = Binary({"\x09"}, 0);
+  EXPECT_TRUE(ParsePropertyList(ok).ok());
+  EXPECT_FALSE(ParsePropertyList(ok.substr(0, ok.size() - 1)).ok());
+  EXPECT_FALSE(ParsePropertyList(Binary({"\x09"}, 1)).ok());           // top object out of range
+  EXPECT_FALSE(ParsePropertyList(Binary({"\xA1\x07"}, 0)).ok());        // reference out of range
+  EXPECT_FALSE(ParsePropertyList(Binary({"\x5F\x10\xff"}, 0)).ok());   // length past the end
+  EXPECT_FALSE(ParsePropertyList(Binary({"\x14\x01"}, 0)).ok());        // short integer
+  EXPECT_FALSE(ParsePropertyList(Binary({"\x0F"}, 0)).ok());             // fill byte
+  EXPECT_FALSE(ParsePropertyList(Binary({"\x09"}, 0, 9)).ok());          // reference size 9
 }
 
 TEST(JsonTest, ReadWriteAndMalformed) {
