@@ -163,26 +163,27 @@ bool TallyStore::InTransaction(const std::function<bool()>& body) {
 
 bool TallyStore::Batch(const std::function<bool()>& body) { return InTransaction(body); }
 
-bool TallyStore::SetScalar(int32_t day, std::string_view key, int64_t value) {
-  Statement st(db_, "INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
-                    "ON CONFLICT(day, key) DO UPDATE SET value = excluded.value");
-  if (!st) return Fail("prepare set");
+bool TallyStore::WriteScalar(const char* sql, const char* what, int32_t day, std::string_view key, int64_t value) {
+  Statement st(db_, sql);
+  if (!st) return Fail(what);
   sqlite3_bind_int(st.get(), 1, day);
   sqlite3_bind_text(st.get(), 2, key.data(), static_cast<int>(key.size()), SQLITE_STATIC);
   sqlite3_bind_int64(st.get(), 3, value);
-  return sqlite3_step(st.get()) == SQLITE_DONE || Fail("set scalar");
+  return sqlite3_step(st.get()) == SQLITE_DONE || Fail(what);
+}
+
+bool TallyStore::SetScalar(int32_t day, std::string_view key, int64_t value) {
+  return WriteScalar("INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
+                     "ON CONFLICT(day, key) DO UPDATE SET value = excluded.value",
+                     "set scalar", day, key, value);
 }
 
 bool TallyStore::AddScalar(int32_t day, std::string_view key, int64_t value) {
   // One statement: the read and the write happen under the same write lock,
   // so concurrent adders never lose each other's increments.
-  Statement st(db_, "INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
-                    "ON CONFLICT(day, key) DO UPDATE SET value = value + excluded.value");
-  if (!st) return Fail("prepare add");
-  sqlite3_bind_int(st.get(), 1, day);
-  sqlite3_bind_text(st.get(), 2, key.data(), static_cast<int>(key.size()), SQLITE_STATIC);
-  sqlite3_bind_int64(st.get(), 3, value);
-  return sqlite3_step(st.get()) == SQLITE_DONE || Fail("add scalar");
+  return WriteScalar("INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
+                     "ON CONFLICT(day, key) DO UPDATE SET value = value + excluded.value",
+                     "add scalar", day, key, value);
 }
 
 bool TallyStore::PushSamples(int32_t day, std::string_view key,

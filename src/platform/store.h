@@ -47,6 +47,7 @@ class TallyStore {
  private:
   TallyStore(sqlite3* db, std::string path) : db_(db), path_(std::move(path)) {}
   bool Exec(const char* sql);
+  bool WriteScalar(const char* sql, const char* what, int32_t day, std::string_view key, int64_t value);
   bool EnableWriteAheadLog();
   bool Fail(const char* what);
   bool InTransaction(const std::function<bool()>& body);
