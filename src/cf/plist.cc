@@ -2,6 +2,7 @@
 
 #include <plist/plist.h>
 
+#include <algorithm>
 #include <charconv>
 #include <cmath>
 #include <cstdlib>
@@ -327,9 +328,11 @@ plist_t ToPlist(const Value& v, int depth, std::string& error) {
     case Type::kData:
       return plist_new_data(reinterpret_cast<const char*>(v.AsData()->data()), v.AsData()->size());
     case Type::kDate: {
-      const double rel = v.AsDate()->seconds - kPlistEpoch;
-      const double whole = std::floor(rel);
-      return plist_new_date(static_cast<int32_t>(whole), static_cast<int32_t>((rel - whole) * 1e6));
+      // The binary writer keeps 32-bit seconds from 2001: dates beyond clamp.
+      const double rel = std::isnan(v.AsDate()->seconds) ? 0 : v.AsDate()->seconds - kPlistEpoch;
+      const double whole = std::min(std::max(std::floor(rel), -2147483648.0), 2147483647.0);
+      const double fraction = std::min(std::max(rel - whole, 0.0), 0.999999);
+      return plist_new_date(static_cast<int32_t>(whole), static_cast<int32_t>(fraction * 1e6));
     }
     case Type::kArray: {
       plist_t a = plist_new_array();
@@ -413,6 +416,6 @@ std::string Base64Encode(const Data& d) {
   return out;
 }
 
-std::string ISO8601(const Date& d) { return FormatUTC(d, "%Y-%m-%dT%H:%M:%SZ"); }
+std::string ISO8601(const Date& d) { return FormatUTC(d, true); }
 
 }  // namespace cf

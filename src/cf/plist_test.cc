@@ -82,6 +82,11 @@ TEST(PlistTest, UnwritableValuesFailWithAReason) {
   }
   EXPECT_FALSE(WriteXMLPropertyList(nested, out, &error));
   EXPECT_EQ(error, "value nested too deeply");
+  // Dates from outside may be absurd: their text stays within years 1 to 9999.
+  EXPECT_TRUE(WriteXMLPropertyList(Value(Date{1e300}), out, &error));
+  EXPECT_NE(out.find("<date>9999-12-31T23:59:59Z</date>"), std::string::npos);
+  EXPECT_EQ(Value(Date{-1e300}).Description(), "0001-01-01 00:00:00 +0000");
+  EXPECT_TRUE(WriteBinaryPropertyList(Value(Date{NAN}), out, &error));
   EXPECT_TRUE(WriteXMLPropertyList(Value::Float64(INFINITY), out, &error));
   EXPECT_NE(out.find("<real>+infinity</real>"), std::string::npos);
 }

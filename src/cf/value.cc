@@ -145,7 +145,7 @@ size_t Number::Hash() const {
     return Mix(std::hash<uint64_t>()(static_cast<uint64_t>(v)), static_cast<size_t>(v >> 64));
   }
   const double d = real_;
-  if (std::isfinite(d) && std::trunc(d) == d && std::fabs(d) < 18446744073709551616.0) {
+  if (std::isfinite(d) && std::trunc(d) == d && d >= -9223372036854775808.0 && d < 18446744073709551616.0) {
     const Int128 v = d < 0 ? Int128(static_cast<int64_t>(d)) : Int128(static_cast<uint64_t>(d));
     return Mix(std::hash<uint64_t>()(static_cast<uint64_t>(v)), static_cast<size_t>(v >> 64));
   }
@@ -378,16 +378,20 @@ size_t Value::Hash() const {
   return 0;
 }
 
-std::string FormatUTC(const Date& d, const char* format) {
-  const time_t secs = static_cast<time_t>(std::floor(d.seconds));
+std::string FormatUTC(const Date& d, bool iso8601) {
+  // Dates from outside can be anything; texts stay within years 1 to 9999.
+  constexpr double kFirst = -62135596800.0, kLast = 253402300799.0;
+  const double clamped = std::isnan(d.seconds) ? 0 : std::min(std::max(std::floor(d.seconds), kFirst), kLast);
+  const time_t secs = static_cast<time_t>(clamped);
   struct tm tm;
   gmtime_r(&secs, &tm);
   char buf[64];
-  std::strftime(buf, sizeof buf, format, &tm);
+  std::snprintf(buf, sizeof buf, iso8601 ? "%04d-%02d-%02dT%02d:%02d:%02dZ" : "%04d-%02d-%02d %02d:%02d:%02d +0000",
+                tm.tm_year + 1900, tm.tm_mon + 1, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec);
   return buf;
 }
 
-std::string DateDescription(const Date& d) { return FormatUTC(d, "%Y-%m-%d %H:%M:%S +0000"); }
+std::string DateDescription(const Date& d) { return FormatUTC(d, false); }
 
 namespace {
 

@@ -221,7 +221,8 @@ void PrintTo(const Value& v, std::ostream* os);
 
 // Text of a date as the system prints it: "2026-11-22 10:00:00 +0000".
 std::string DateDescription(const Date& d);
-// A date in UTC through a strftime format (whole seconds).
-std::string FormatUTC(const Date& d, const char* format);
+// A date in UTC to whole seconds: "2026-11-22T10:00:00Z" (ISO 8601) or
+// "2026-11-22 10:00:00 +0000".
+std::string FormatUTC(const Date& d, bool iso8601);
 
 }  // namespace cf

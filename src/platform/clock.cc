@@ -50,8 +50,9 @@ std::optional<double> ParseInstant(std::string_view text) {
     std::string s(text);
     char* end = nullptr;
     const double v = std::strtod(s.c_str(), &end);
+    // Within years 1 to 9999, so every later conversion stays defined.
     if (end && *end == '\0' && (std::isdigit(static_cast<unsigned char>(s[0])) || s[0] == '-') &&
-        s.find_first_of("eExXnN") == std::string::npos && std::isfinite(v))
+        s.find_first_of("eExXnN") == std::string::npos && v >= -62135596800.0 && v <= 253402300799.0)
       return v;
   }
   // YYYY-MM-DD[(T| )HH:MM[:SS[.fff]]][Z|(+|-)HH[:]MM]

@@ -70,7 +70,7 @@ int Snapshot(const std::string& file, const std::string& header_file) {
     const int result = VSPParseSnapshotBufferWithInplaceParser(data.data(), static_cast<uint32_t>(data.size()),
                                                                out.data(), &size, header.data(),
                                                                static_cast<uint32_t>(header.size()), &index);
-    std::fputs(out.data(), stdout);
+    std::fwrite(out.data(), 1, size - 1, stdout);  // the text may hold a NUL of its own
     if (result) return 0;
   }
 }
