@@ -67,24 +67,15 @@ std::unique_ptr<TBHistory> TBHistory::initWithDefaultPath(std::string* error) {
 }
 
 std::unique_ptr<TBHistory> TBHistory::initWithPath(const std::string& path, std::string* error) {
-  // Check the file through the store's own open, which refuses foreign files
-  // without touching them and brings an empty store up to the schema.
-  std::string why;
-  if (!TallyStore::Open(path, TallyStore::Mode::kExisting, &why)) {
-    if (error) *error = why;
-    return nullptr;
-  }
-  sqlite3* db = nullptr;
-  if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr) != SQLITE_OK) {
-    if (error) *error = db ? sqlite3_errmsg(db) : "out of memory";
-    sqlite3_close(db);
-    return nullptr;
-  }
-  sqlite3_busy_timeout(db, 30000);
-  return std::unique_ptr<TBHistory>(new TBHistory(db));
+  // The store's own open refuses foreign files without touching them; its
+  // connection is the one the history reads through.
+  std::unique_ptr<TallyStore> store = TallyStore::Open(path, TallyStore::Mode::kExisting, error);
+  if (!store) return nullptr;
+  return std::unique_ptr<TBHistory>(new TBHistory(std::move(store)));
 }
 
-TBHistory::~TBHistory() { sqlite3_close_v2(db_); }
+TBHistory::TBHistory(std::unique_ptr<TallyStore> store) : store_(std::move(store)), db_(store_->handle()) {}
+TBHistory::~TBHistory() = default;
 
 bool TBHistory::scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
                                     const ScalarHandler& rowHandler) {

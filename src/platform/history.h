@@ -15,6 +15,8 @@ struct sqlite3_stmt;
 
 namespace platform {
 
+class TallyStore;
+
 class TBHistoryDistributionEnumerator {
  public:
   // False when no sample is left.
@@ -49,7 +51,8 @@ class TBHistory {
                                  const DistributionHandler& rowHandler);
 
  private:
-  explicit TBHistory(sqlite3* db) : db_(db) {}
+  explicit TBHistory(std::unique_ptr<TallyStore> store);
+  std::unique_ptr<TallyStore> store_;
   sqlite3* db_;
 };
 
