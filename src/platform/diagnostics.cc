@@ -160,19 +160,19 @@ cf::Value DVCopyAnswer(std::string_view question) {
   return ReadProfileDictionary("/device/answers.plist").Get(std::string(question));
 }
 
-bool DVGetBoolAnswer(std::string_view question) {
+namespace {
+// A boolean answer (a boolean or a number), or the default when absent.
+bool BoolAnswer(std::string_view question, bool absent) {
   const cf::Value v = DVCopyAnswer(question);
   if (auto b = v.AsBool()) return *b;
   if (auto n = v.AsNumber()) return n->AsSInt64() != 0;
-  return false;
+  return absent;
 }
+}  // namespace
 
-bool DiagnosticLogSubmissionEnabled() {
-  const cf::Value v = DVCopyAnswer("DiagnosticLogSubmissionEnabled");
-  if (auto b = v.AsBool()) return *b;
-  if (auto n = v.AsNumber()) return n->AsSInt64() != 0;
-  return true;
-}
+bool DVGetBoolAnswer(std::string_view question) { return BoolAnswer(question, false); }
+
+bool DiagnosticLogSubmissionEnabled() { return BoolAnswer("DiagnosticLogSubmissionEnabled", true); }
 
 void FKDumpAllOldStructuredDataLogs() {
   const std::string dir = Context::Current().Path("/var/faultkeep");
