@@ -44,15 +44,6 @@ size_t Mix(size_t h, size_t v) { return h ^ (v + 0x9e3779b97f4a7c15ULL + (h << 6
 
 }  // namespace
 
-bool IsValidNumberType(int code) {
-  switch (code) {
-    case 1: case 2: case 3: case 4: case 5: case 6: case 9: case 12: case 13: case 100:
-      return true;
-    default:
-      return false;
-  }
-}
-
 bool Number::IsFloat() const {
   return type_ == NumberType::kFloat32 || type_ == NumberType::kFloat64 ||
          type_ == NumberType::kFloat || type_ == NumberType::kDouble;

@@ -35,8 +35,6 @@ enum class NumberType : int {
   kUInt64 = 100,
 };
 
-bool IsValidNumberType(int code);
-
 // A number that remembers the type it was made with. Reading it as another
 // type follows C's conversions: integer to narrower integer keeps the low
 // bits, floating to integer truncates toward zero (saturating outside the
