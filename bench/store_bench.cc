@@ -45,10 +45,10 @@ double StreamDay(const std::string& path) {
     std::exit(1);
   }
   double check = 0;
-  history->scalarsForKeyPrefix("", kDay, kDay, [&](const std::string&, int32_t, int64_t v, bool*) {
+  history->scalarsForKeyPrefix("", kDay - 1, kDay, [&](const std::string&, int32_t, int64_t v, bool*) {
     check += static_cast<double>(v);
   });
-  history->distributionsForKeyPrefix("", kDay, kDay,
+  history->distributionsForKeyPrefix("", kDay - 1, kDay,
                                      [&](const std::string&, int32_t, platform::TBHistoryDistributionEnumerator& e, bool*) {
                                        Summary s;
                                        double v;

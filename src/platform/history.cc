@@ -81,7 +81,7 @@ bool TBHistory::scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSinc
                                     const ScalarHandler& rowHandler) {
   ReadTransaction txn(db_);
   if (!txn.ok()) return false;
-  StatementPtr rows = Prepare(db_, std::string("SELECT key, day, value FROM scalars WHERE day BETWEEN ?1 AND ?2") +
+  StatementPtr rows = Prepare(db_, std::string("SELECT key, day, value FROM scalars WHERE day > ?1 AND day <= ?2") +
                                        kPrefixClause + " ORDER BY day, key");
   if (!rows) return false;
   BindRange(rows.get(), prefix, minDaysSince1970, maxDaysSince1970);
@@ -101,7 +101,7 @@ bool TBHistory::distributionsForKeyPrefix(std::string_view prefix, int32_t minDa
                                           int32_t maxDaysSince1970, const DistributionHandler& rowHandler) {
   ReadTransaction txn(db_);
   if (!txn.ok()) return false;
-  StatementPtr rows = Prepare(db_, std::string("SELECT id, key, day FROM series WHERE day BETWEEN ?1 AND ?2") +
+  StatementPtr rows = Prepare(db_, std::string("SELECT id, key, day FROM series WHERE day > ?1 AND day <= ?2") +
                                        kPrefixClause + " ORDER BY day, key");
   StatementPtr samples = Prepare(db_, "SELECT value, offset FROM samples WHERE series = ?1 ORDER BY seq");
   if (!rows || !samples) return false;

@@ -40,8 +40,10 @@ class TBHistory {
   static std::unique_ptr<TBHistory> initWithPath(const std::string& path, std::string* error = nullptr);
   ~TBHistory();
 
-  // Rows of days min..max (inclusive) whose key starts with prefix, ordered
-  // by day, then key. False when the store could not be read.
+  // Rows of the days after min, up to and including max (min < day <= max),
+  // whose key starts with prefix, ordered by day, then key: the report asks
+  // for (D - 1, D] and gets exactly day D. False when the store could not be
+  // read.
   bool scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
                            const ScalarHandler& rowHandler);
   // One row per key and day, in the same order; the enumerator yields that

@@ -65,11 +65,11 @@ TEST(StoreTest, ConcurrentWritersLoseNothing) {
   }
   auto history = TBHistory::initWithPath(path);
   ASSERT_NE(history, nullptr);
-  const auto rows = Scalars(*history, "", 100, 100);
+  const auto rows = Scalars(*history, "", 99, 100);
   ASSERT_EQ(rows.size(), 1u);
   EXPECT_EQ(rows[0].value, int64_t{kWriters} * kAdds * (kAdds + 1) / 2);
   size_t samples = 0;
-  history->distributionsForKeyPrefix("", 100, 100, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
+  history->distributionsForKeyPrefix("", 99, 100, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
     while (e.getNextValue(nullptr, nullptr)) ++samples;
   });
   EXPECT_EQ(samples, size_t{kWriters} * kAdds / 10);
@@ -93,10 +93,13 @@ TEST(StoreTest, HistoryStreamsInDayKeyOrderWithPrefixAndRange) {
 
   auto history = TBHistory::initWithPath(path);
   ASSERT_NE(history, nullptr);
-  EXPECT_EQ(Scalars(*history, "", 10, 11),
+  EXPECT_EQ(Scalars(*history, "", 9, 11),
             (std::vector<Row>{{10, "b.one", 1}, {11, "a.x", -5}, {11, "b", 7}, {11, "b.three", -1},
                               {11, "b.two", 20}, {11, "cX", 9}, {11, "c_", 8}}));
-  EXPECT_EQ(Scalars(*history, "b", 11, 12), (std::vector<Row>{{11, "b", 7}, {11, "b.three", -1}, {11, "b.two", 20}}));
+  // The minimum is excluded, the maximum included: (10, 11] is day 11 alone.
+  EXPECT_EQ(Scalars(*history, "b", 10, 11), (std::vector<Row>{{11, "b", 7}, {11, "b.three", -1}, {11, "b.two", 20}}));
+  EXPECT_EQ(Scalars(*history, "", 11, 12), (std::vector<Row>{{12, "a.y", 9}}));
+  EXPECT_TRUE(Scalars(*history, "", 12, 12).empty());
   EXPECT_EQ(Scalars(*history, "c_", 0, 100), (std::vector<Row>{{11, "c_", 8}}));
   EXPECT_TRUE(Scalars(*history, "", 13, 20).empty());
   EXPECT_TRUE(Scalars(*history, "", 12, 11).empty());
@@ -115,7 +118,7 @@ TEST(StoreTest, HistoryStreamsInDayKeyOrderWithPrefixAndRange) {
   std::vector<std::string> order;
   std::vector<std::pair<double, int32_t>> lat11;
   ASSERT_TRUE(history->distributionsForKeyPrefix(
-      "d.", 10, 11, [&](const std::string& key, int32_t day, TBHistoryDistributionEnumerator& e, bool*) {
+      "d.", 9, 11, [&](const std::string& key, int32_t day, TBHistoryDistributionEnumerator& e, bool*) {
         order.push_back(std::to_string(day) + " " + key);
         double v;
         int32_t off;
@@ -136,7 +139,7 @@ TEST(StoreTest, AHistoryCallSeesOneConsistentView) {
   ASSERT_TRUE(store->SetScalar(5, "s", 1));
   auto history = TBHistory::initWithPath(path);
   int count = 0;
-  ASSERT_TRUE(history->distributionsForKeyPrefix("", 5, 5, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
+  ASSERT_TRUE(history->distributionsForKeyPrefix("", 4, 5, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
     // A writer commits while the reader is half-way: the reader keeps its view.
     ASSERT_TRUE(e.getNextValue(nullptr, nullptr));
     ++count;
@@ -148,7 +151,7 @@ TEST(StoreTest, AHistoryCallSeesOneConsistentView) {
   EXPECT_EQ(count, 2);
   // The next call sees the new rows.
   int keys = 0;
-  history->distributionsForKeyPrefix("", 5, 5, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++keys; });
+  history->distributionsForKeyPrefix("", 4, 5, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++keys; });
   EXPECT_EQ(keys, 2);
 }
 
@@ -204,7 +207,7 @@ TEST(StoreTest, ClientCallsWriteTodayUnderTheRoot) {
   ASSERT_TRUE(TBClientCheckpoint());
   auto history = TBHistory::initWithDefaultPath();
   ASSERT_NE(history, nullptr);
-  EXPECT_EQ(Scalars(*history, "", 20000, 20000), (std::vector<Row>{{20000, "com.velmora.x", 11}}));
+  EXPECT_EQ(Scalars(*history, "", 19999, 20000), (std::vector<Row>{{20000, "com.velmora.x", 11}}));
   EXPECT_TRUE(FileExists(root / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb"));
 
   // A broken store: the client answers false with one error line, and never writes.

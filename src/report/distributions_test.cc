@@ -98,7 +98,7 @@ class SummaryTest : public ::testing::Test {
     const std::string key = "k" + std::to_string(++n_);
     ASSERT_TRUE(store->PushSamples(1, key, values));
     auto history = platform::TBHistory::initWithPath(path);
-    history->distributionsForKeyPrefix(key, 1, 1, [&](const std::string& k, int32_t, platform::TBHistoryDistributionEnumerator& e, bool*) {
+    history->distributionsForKeyPrefix(key, 0, 1, [&](const std::string& k, int32_t, platform::TBHistoryDistributionEnumerator& e, bool*) {
       if (k == key) report.computeAndAddDistribution(e, "out", options);
     });
   }

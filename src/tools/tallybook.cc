@@ -4,6 +4,7 @@
 #include <charconv>
 #include <cmath>
 #include <cstdio>
+#include <algorithm>
 #include <limits>
 #include <string>
 
@@ -56,7 +57,9 @@ int Dump(bool one_day, int64_t day, const std::string& prefix) {
     std::fprintf(stderr, "tallybook: %s\n", error.c_str());
     return kStoreError;
   }
-  const int32_t lo = one_day ? static_cast<int32_t>(day) : std::numeric_limits<int32_t>::min();
+  // The history's range excludes its minimum.
+  const int32_t lo = one_day ? static_cast<int32_t>(std::max<int64_t>(day - 1, std::numeric_limits<int32_t>::min()))
+                             : std::numeric_limits<int32_t>::min();
   const int32_t hi = one_day ? static_cast<int32_t>(day) : std::numeric_limits<int32_t>::max();
   bool ok = history->scalarsForKeyPrefix(prefix, lo, hi, [](const std::string& key, int32_t d, int64_t v, bool*) {
     std::printf("%d %s %lld\n", d, key.c_str(), static_cast<long long>(v));

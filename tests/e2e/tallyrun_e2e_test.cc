@@ -1,5 +1,7 @@
 // The daily job as a process: modes, gate, report, OS changes and the
 // service's messages, in a fresh device root made by devsim.
+#include <set>
+
 #include "root_fixture.h"
 
 namespace {
@@ -38,11 +40,11 @@ TEST_F(TallyrunTest, GatedRunHappensOncePerDay) {
   EXPECT_EQ(log.Get("TBTaskDigest"), cf::Value("(no tasking digest)"));
   EXPECT_EQ(log.Get("TBWhitelistDigest").AsString()->size(), 32u);
   EXPECT_FALSE(log.Contains("TBActivatedAppInfo"));
-  std::vector<std::string> keys;
-  for (const auto& [k, v] : log) keys.push_back(*k.AsString());
-  EXPECT_EQ(keys, (std::vector<std::string>{"TBCrashLogVersion", "TBStartDate", "TBLogCreationDate", "TBMetadata",
-                                            "TBScalars", "TBDistributions", "TBDistributionsHistogram", "TBTasking",
-                                            "TBTaskID", "TBTaskDigest", "TBWhitelistDigest"}));
+  std::set<std::string> keys;
+  for (const auto& [k, v] : log) keys.insert(*k.AsString());
+  EXPECT_EQ(keys, (std::set<std::string>{"TBCrashLogVersion", "TBStartDate", "TBLogCreationDate", "TBMetadata",
+                                         "TBScalars", "TBDistributions", "TBDistributionsHistogram", "TBTasking",
+                                         "TBTaskID", "TBTaskDigest", "TBWhitelistDigest"}));
 
   r = Tallyrun({"-d"});
   EXPECT_EQ(Count(r.err, "<default>: Day unchanged since last run\n"), 1u);
@@ -56,6 +58,34 @@ TEST_F(TallyrunTest, GatedRunHappensOncePerDay) {
   env["TALLYRUN_NOW"] = "2026-11-23T09:00:00Z";
   EXPECT_EQ(Count(Tallyrun({"-d"}).err, "daily tasks for day 20779"), 1u);
   EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday));
+}
+
+TEST_F(TallyrunTest, ALogHoldsItsOwnDayOnly) {
+  // Day 20779 (today at init) has two listed keys on the day before only.
+  auto at = [&](const char* now) {
+    auto e = env;
+    e["TALLYRUN_NOW"] = now;
+    return e;
+  };
+  ASSERT_EQ(RunProgram(TALLYBOOK_BIN, {"set", "com.velmora.wifi.OnlyTheDayBefore", "5"}, at("2026-11-21T12:00:00Z")).status, 0);
+  ASSERT_EQ(RunProgram(TALLYBOOK_BIN, {"push", "com.velmora.net.OnlyTheDayBefore", "1.5"}, at("2026-11-21T12:00:00Z")).status, 0);
+  env["TALLYRUN_NOW"] = "2026-11-23T09:00:00Z";
+  ASSERT_EQ(Count(Tallyrun({"-f"}).err, "writing aggregated log. yesterday=20779"), 1u);
+  ASSERT_EQ(Logs().size(), 1u);
+  const cf::Dictionary log = LastLog();
+  EXPECT_EQ(log.Get("TBStartDate"), cf::Value(cf::Date{86400.0 * kToday}));
+  EXPECT_TRUE(log.Get("TBScalars").AsDictionary()->Contains("com.velmora.homedeck.Unlocks"));
+  EXPECT_FALSE(log.Get("TBScalars").AsDictionary()->Contains("com.velmora.wifi.OnlyTheDayBefore"));
+  EXPECT_FALSE(log.Get("TBDistributions").AsDictionary()->Contains("com.velmora.net.OnlyTheDayBefore"));
+
+  // Day 20780 has no rows of its own: no log at all, not a copy of the day before.
+  env["TALLYRUN_NOW"] = "2026-11-24T09:00:00Z";
+  ASSERT_EQ(Count(Tallyrun({"-f"}).err, "writing aggregated log. yesterday=20780"), 1u);
+  EXPECT_EQ(Logs().size(), 1u);
+
+  // The tool's day still means that day.
+  const RunResult dump = RunProgram(TALLYBOOK_BIN, {"dump", "--day", "20778", "--prefix", "com.velmora.wifi.Only"}, env);
+  EXPECT_EQ(dump.out, "20778 com.velmora.wifi.OnlyTheDayBefore 5\n");
 }
 
 TEST_F(TallyrunTest, ForceTodayAndArguments) {
