@@ -36,11 +36,13 @@ enum class Action { kApply, kRemove };
 
 // Writes or removes one payload entry, by its user.
 void Process(const cf::Value& entry, Action action, DomainSet& touched) {
+  // Only string keys and domains can name a preference; anything else would
+  // be stored as pending and keep its whole domain from being written.
   const cf::Dictionary* e = entry.AsDictionary();
   const cf::Value key = e ? e->Get("Key") : cf::Value();
   const std::string* domain = e ? e->Get("Domain").AsString() : nullptr;
-  if (key.IsNull() || !domain) {
-    LogError("Skipping a tasking entry without Key or Domain: %@", entry);
+  if (!key.AsString() || !domain) {
+    LogError("Skipping a tasking entry without a string Key or Domain: %@", entry);
     return;
   }
   const std::string* user_value = e->Get("User").AsString();

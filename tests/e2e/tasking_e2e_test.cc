@@ -112,9 +112,16 @@ TEST_F(Tasking, IdentifierWithoutPayloadPostsEveryRunAndBadEntriesAreSkipped) {
   cf::Dictionary no_key;
   no_key.Set("Domain", "com.velmora.da");
   no_key.Set("User", "mobile");
-  Schedule("T10", cf::Array({no_key, Entry("com.velmora.da", "mobile", "Network", cf::Value::Bool(true))}));
+  // A Key or Domain that is not a string is skipped too, and does not keep
+  // the valid entry of the same domain from being written.
+  cf::Dictionary number_key = Entry("com.velmora.da", "mobile", "", cf::Value::SInt32(1));
+  number_key.Set("Key", cf::Value::SInt32(5));
+  cf::Dictionary number_domain = Entry("", "mobile", "Other", cf::Value::SInt32(1));
+  number_domain.Set("Domain", cf::Value::SInt32(5));
+  Schedule("T10", cf::Array({no_key, number_key, number_domain,
+                             Entry("com.velmora.da", "mobile", "Network", cf::Value::Bool(true))}));
   const RunResult r = Tallyrun({"-f"});
-  EXPECT_EQ(Count(r.err, "<error>: Skipping a tasking entry without Key or Domain: {"), 1u);
+  EXPECT_EQ(Count(r.err, "<error>: Skipping a tasking entry without a string Key or Domain: {"), 3u);
   EXPECT_EQ(PrefIn("Library/Preferences/com.velmora.da.plist", "Network"), cf::Value::Bool(true));
   EXPECT_EQ(Notifications(), 3u);
 
