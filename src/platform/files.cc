@@ -60,12 +60,24 @@ std::optional<int64_t> FileSize(const std::string& path) {
 }
 
 bool MakeDirectories(const std::string& path) {
-  if (path.empty()) return false;
+  if (path.empty()) {
+    errno = ENOENT;
+    return false;
+  }
   struct stat st;
-  if (stat(path.c_str(), &st) == 0) return S_ISDIR(st.st_mode);
+  if (stat(path.c_str(), &st) == 0) {
+    if (S_ISDIR(st.st_mode)) return true;
+    errno = ENOTDIR;  // a file stands where a directory must be
+    return false;
+  }
   const size_t slash = path.find_last_of('/');
   if (slash != std::string::npos && slash > 0 && !MakeDirectories(path.substr(0, slash))) return false;
-  return mkdir(path.c_str(), 0755) == 0 || errno == EEXIST;
+  if (mkdir(path.c_str(), 0755) == 0) return true;
+  // Another process may have made it meanwhile; anything else keeps mkdir's errno.
+  if (errno != EEXIST) return false;
+  if (stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return true;
+  errno = ENOTDIR;
+  return false;
 }
 
 bool WriteFileAtomically(const std::string& path, std::string_view bytes, std::string* error, int mode) {

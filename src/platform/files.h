@@ -11,7 +11,8 @@ namespace platform {
 // The whole file, or nothing when it cannot be read (reason in *error).
 std::optional<std::string> ReadFile(const std::string& path, std::string* error = nullptr);
 
-// Creates the directory and its parents (mode 0755). True when it exists.
+// Creates the directory and its parents (mode 0755). True when it exists;
+// otherwise errno says why (ENOTDIR when a file stands in the way).
 bool MakeDirectories(const std::string& path);
 
 // Replaces path with bytes so that a reader sees the old file or the new one,

@@ -105,6 +105,15 @@ TEST(ServiceTest, MessagesReachTheHandlerAndBadFramesOnlyEndTheirConnection) {
   EXPECT_NE(error.find("no service listening at " + path), std::string::npos) << error;
 }
 
+TEST(ServiceTest, AFileWhereTheSocketDirectoryBelongsIsReportedAsSuch) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  ASSERT_TRUE(WriteFileAtomically(root / "var/run", "a file in the way"));
+  EXPECT_EQ(xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER), nullptr);
+  EXPECT_EQ(log->Count("Cannot create the directory of " + ServiceSocketPath(kName) + ": Not a directory"), 1u);
+}
+
 TEST(ServiceTest, RunLoopWithoutSourcesWaitsOutItsTime) {
   const auto start = std::chrono::steady_clock::now();
   EXPECT_EQ(CFRunLoopRunInMode(0.3, true), kCFRunLoopRunTimedOut);
