@@ -106,16 +106,31 @@ TEST_F(MetricsTest, FreezerRowsGatesSentinelsAndRatios) {
   EXPECT_EQ(Get(second, "com.velmora.memorystatus_freezer_thaw_percentage"), cf::Value::SInt64(23));
 }
 
-TEST_F(MetricsTest, UnlistedKeysAreNeverMeasured) {
-  List({"com.velmora.other"});
-  Kernel({{"kern.memorystatus_freeze_pageouts", 5}});
+TEST_F(MetricsTest, AMeasurementRunsOnlyForAListedKey) {
+  List({"com.velmora.listed"});
   TBReport r;
+  int runs = 0;
+  r.addScalarForKey("com.velmora.unlisted", [&] { return int64_t{++runs}; });
+  EXPECT_EQ(runs, 0);
+  r.addScalarForKey("com.velmora.listed", [&] { return int64_t{++runs} + 6; });
+  EXPECT_EQ(runs, 1);
+  EXPECT_EQ(Get(r, "com.velmora.listed"), cf::Value::SInt64(7));
+
+  // The corruption counter is read and reset only when its key is listed:
+  // unlisted, the count stays for the day it is.
+  InstallSupportLibrary();
+  DGVPreferencesSetValue("DatabaseCorruptionCount", cf::Value::SInt64(4), "com.velmora.tallybookd");
+  ASSERT_TRUE(DGVPreferencesSynchronize("com.velmora.tallybookd"));
   r.reportVMStats();
   r.reportCPUUptime();
   r.reportDatabaseSize();
   r.addInstalledAppInfo();
-  EXPECT_TRUE(r.scalarsOutput().empty());
-  EXPECT_EQ(log->CountContaining("FaultkeepSupport"), 0u);  // the counter was not touched
+  EXPECT_EQ(r.scalarsOutput().size(), 1u);
+  // Listed now: the count is still there to be read.
+  List({"com.velmora.diagvault.tbkd.database.corruptions"});
+  TBReport listed;
+  listed.reportDatabaseSize();
+  EXPECT_EQ(Get(listed, "com.velmora.diagvault.tbkd.database.corruptions"), cf::Value::SInt64(4));
 }
 
 TEST_F(MetricsTest, DatabaseSizeAndCorruptionCounter) {
