@@ -8,6 +8,7 @@
 #include "platform/service.h"
 
 inline constexpr const char* kServiceName = "com.velmora.tallybookd.tallyrun";
+inline constexpr const char* kInstanceLockPath = "/var/run/tallyrun.lock";
 inline constexpr const char* kGateKey = "LastCrashLogSerializationDateInDaysSince1970";
 inline constexpr const char* kLoggingNotification = "com.velmora.tallybookd.tallyrun.logging";
 

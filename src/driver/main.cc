@@ -3,8 +3,10 @@
 
 #include "driver/driver.h"
 #include "platform/context.h"
+#include "platform/files.h"
 #include "platform/log.h"
 #include "platform/store.h"
+#include "platform/upkeep.h"
 
 using platform::LogDefault;
 
@@ -22,7 +24,23 @@ double IdleSeconds() {
 }  // namespace
 
 int TallyrunMain(int argc, char** argv) {
+  platform::ApplyPrivateUmask();
   LogDefault("tallyrun started");
+  // One instance at a time: a run waits for the one before it (and then
+  // finds its gate record); a service that finds another one running leaves
+  // that one its socket.
+  std::string lock_error;
+  const auto lock = platform::FileLock::Acquire(
+      platform::Context::Current().Path(kInstanceLockPath),
+      argc == 1 ? platform::FileLock::Wait::kTry : platform::FileLock::Wait::kBlock, &lock_error);
+  if (!lock && lock_error.empty()) {
+    LogDefault("Another tallyrun is running; leaving the work to it");
+    LogDefault("tallyrun ended");
+    return 0;
+  }
+  // A lock file that cannot be had at all must not cost the day's work.
+  if (!lock) platform::LogError("Running without the instance lock: %s", lock_error);
+  platform::TidyRoot();
   if (argc == 1) {
     platform::xpc_connection_t listener =
         xpc_connection_create_mach_service(kServiceName, platform::XPC_CONNECTION_MACH_SERVICE_LISTENER);

@@ -37,12 +37,7 @@ bool AnalyticsSendEventLazy(std::string_view event, const std::function<cf::Valu
     return false;
   }
   line += '\n';
-  const std::string dir = platform::Context::Current().Path("/var/eventlens");
-  const int fd = platform::MakeDirectories(dir)
-                     ? open((dir + "/events.jsonl").c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644)
-                     : -1;
-  const bool ok = fd >= 0 && write(fd, line.data(), line.size()) == static_cast<ssize_t>(line.size());
-  if (!ok) platform::LogError("Cannot record event %s: %s", std::string(event), std::strerror(errno));
-  if (fd >= 0) close(fd);
+  const bool ok = platform::AppendToFile(platform::Context::Current().Path("/var/eventlens/events.jsonl"), line, &error);
+  if (!ok) platform::LogError("Cannot record event %s: %s", std::string(event), error);
   return ok;
 }

@@ -24,26 +24,18 @@
 namespace platform {
 namespace {
 
-class FdOutput : public LogOutput {
+// The writer's bytes are gathered first, so that the file is written and
+// named in one go.
+class StringOutput : public LogOutput {
  public:
-  explicit FdOutput(int fd) : fd_(fd) {}
   bool Write(std::string_view bytes) override {
-    while (!bytes.empty()) {
-      const ssize_t n = ::write(fd_, bytes.data(), bytes.size());
-      if (n < 0) {
-        if (errno == EINTR) continue;
-        failed_ = true;
-        return false;
-      }
-      bytes.remove_prefix(static_cast<size_t>(n));
-    }
+    bytes_.append(bytes);
     return true;
   }
-  bool failed() const { return failed_; }
+  const std::string& bytes() const { return bytes_; }
 
  private:
-  int fd_;
-  bool failed_ = false;
+  std::string bytes_;
 };
 
 std::string LocalStamp(double t, const char* format) {
@@ -88,56 +80,62 @@ bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, cons
     LogError("Refusing log submission with type \"%s\" and name \"%s\"", std::string(type), std::string(name));
     return false;
   }
-  if (!MakeDirectories(dir)) {
+  std::string error;
+  std::optional<Directory> d = Directory::Open(dir, true, &error);
+  if (!d) {
     LogError("Cannot create %s: %s", dir, std::strerror(errno));
     return false;
   }
-  // The bytes go to a temp file first; the final name is claimed with link(),
-  // which fails rather than replace a log that is already there.
-  std::string temp = dir + "/.submission.XXXXXX";
-  const int fd = mkstemp(temp.data());
-  if (fd < 0) {
-    LogError("Cannot create a submission file in %s: %s", dir, std::strerror(errno));
-    return false;
-  }
-  FdOutput out(fd);
+  StringOutput out;
   writer(out);
-  const bool written = !out.failed() && fsync(fd) == 0;
-  close(fd);
-  if (!written) {
-    LogError("Cannot write the submission of %s", std::string(name));
-    unlink(temp.c_str());
-    return false;
-  }
-  chmod(temp.c_str(), 0644);
   const double now = Now();
-  const std::string base = std::string(name) + "_" + LocalStamp(now, "%Y-%m-%d-%H%M%S");
-  std::string final_path;
-  for (int n = 0; n < 10000; ++n) {
-    const std::string candidate =
-        dir + "/" + base + (n == 0 ? "" : "-" + std::to_string(n)) + "." + std::string(type);
-    if (link(temp.c_str(), candidate.c_str()) == 0) {
-      final_path = candidate;
-      break;
-    }
-    if (errno != EEXIST) break;
-  }
-  unlink(temp.c_str());
-  if (final_path.empty()) {
-    LogError("Cannot name the submission of %s in %s", std::string(name), dir);
-    return false;
-  }
   cf::Dictionary meta;
   meta.Set("type", std::string(type));
   meta.Set("name", std::string(name));
   meta.Set("options", options.AsDictionary() ? options : cf::Value(cf::Dictionary()));
   meta.Set("created", cf::ISO8601(cf::Date{now}));
-  std::string json, error;
-  if (!cf::WriteJSON(meta, json, &error, 2) || !WriteFileAtomically(final_path + ".json", json + "\n", &error)) {
-    LogError("Cannot write the description of %s: %s", final_path, error);
-    unlink(final_path.c_str());
+  std::string json;
+  if (!cf::WriteJSON(meta, json, &error, 2)) {
+    LogError("Cannot describe the submission of %s: %s", std::string(name), error);
     return false;
   }
+  json += "\n";
+
+  // Both files are complete and synced under temporary names before either
+  // gets its own. The description takes its name first and the log last, so
+  // a log never stands without its description; a description left alone by
+  // a crash is removed by the next run. link() claims a name without ever
+  // replacing a log that is already there.
+  std::string log_temp, json_temp;
+  if (!d->WriteTemp("submission", out.bytes(), 0, &log_temp, &error) ||
+      !d->WriteTemp("submission-description", json, 0, &json_temp, &error)) {
+    LogError("Cannot write the submission of %s: %s", std::string(name), error);
+    if (!log_temp.empty()) d->Unlink(log_temp);
+    return false;
+  }
+  const std::string base = std::string(name) + "_" + LocalStamp(now, "%Y-%m-%d-%H%M%S");
+  std::string final_name;
+  for (int n = 0; n < 10000 && final_name.empty(); ++n) {
+    const std::string candidate = base + (n == 0 ? "" : "-" + std::to_string(n)) + "." + std::string(type);
+    if (!d->Link(json_temp, candidate + ".json", &error)) {
+      if (errno == EEXIST) continue;
+      break;
+    }
+    if (!d->Link(log_temp, candidate, &error)) {
+      const bool taken = errno == EEXIST;
+      d->Unlink(candidate + ".json");
+      if (taken) continue;
+      break;
+    }
+    final_name = candidate;
+  }
+  d->Unlink(log_temp);
+  d->Unlink(json_temp);
+  if (final_name.empty()) {
+    LogError("Cannot name the submission of %s in %s: %s", std::string(name), dir, error);
+    return false;
+  }
+  if (!d->Sync()) LogError("Cannot sync %s: %s", dir, std::strerror(errno));
   return true;
 }
 
@@ -175,52 +173,56 @@ bool DVGetBoolAnswer(std::string_view question) { return BoolAnswer(question, fa
 bool DiagnosticLogSubmissionEnabled() { return BoolAnswer("DiagnosticLogSubmissionEnabled", true); }
 
 void FKDumpAllOldStructuredDataLogs() {
-  const std::string dir = Context::Current().Path("/var/faultkeep");
+  const std::string path = Context::Current().Path("/var/faultkeep");
   const double today_start = StartOfDay(TBDaysSince1970());
-  for (const Entry& e : RegularFiles(dir)) {
+  std::optional<Directory> dir;
+  std::optional<Directory> old_dir;
+  std::string error;
+  for (const Entry& e : RegularFiles(path)) {
     if (static_cast<double>(e.mtime_ns) / 1e9 >= today_start) continue;
-    const std::string old_dir = dir + "/old";
-    if (!MakeDirectories(old_dir)) {
-      LogError("Cannot create %s: %s", old_dir, std::strerror(errno));
+    if (!dir) dir = Directory::Open(path, false, &error);
+    if (dir && !old_dir) old_dir = Directory::Open(path + "/old", true, &error);
+    if (!dir || !old_dir) {
+      LogError("%s", error);
       return;
     }
     // Keep the day the file was last written in its new name.
     const size_t dot = e.name.find_last_of('.');
     const std::string stem = dot == std::string::npos || dot == 0 ? e.name : e.name.substr(0, dot);
     const std::string ext = dot == std::string::npos || dot == 0 ? "" : e.name.substr(dot);
-    std::string target = old_dir + "/" + stem + "-" + LocalStamp(static_cast<double>(e.mtime_ns) / 1e9, "%Y-%m-%d") + ext;
-    for (int n = 1; FileExists(target) && n < 1000; ++n)
-      target = old_dir + "/" + stem + "-" + LocalStamp(static_cast<double>(e.mtime_ns) / 1e9, "%Y-%m-%d") + "-" +
-               std::to_string(n) + ext;
-    if (rename((dir + "/" + e.name).c_str(), target.c_str()) != 0)
-      LogError("Cannot move %s/%s to %s: %s", dir, e.name, target, std::strerror(errno));
+    const std::string day = LocalStamp(static_cast<double>(e.mtime_ns) / 1e9, "%Y-%m-%d");
+    bool moved = false;
+    for (int n = 0; n < 1000 && !moved; ++n) {
+      moved = dir->MoveTo(e.name, *old_dir, stem + "-" + day + (n ? "-" + std::to_string(n) : "") + ext, &error);
+      if (!moved && errno != EEXIST) break;
+    }
+    if (!moved) LogError("%s", error);
   }
 }
 
 void rollHalvernLogs() {
   constexpr size_t kKeep = 7;
-  const std::string dir = Context::Current().Path("/var/halvern");
-  std::vector<Entry> files = RegularFiles(dir);
+  const std::string path = Context::Current().Path("/var/halvern");
+  std::vector<Entry> files = RegularFiles(path);
   if (files.size() <= kKeep) return;
+  std::string error;
+  std::optional<Directory> dir = Directory::Open(path, false, &error);
+  if (!dir) {
+    LogError("%s", error);
+    return;
+  }
   std::sort(files.begin(), files.end(), [](const Entry& a, const Entry& b) {
     return a.mtime_ns != b.mtime_ns ? a.mtime_ns > b.mtime_ns : a.name > b.name;
   });
   for (size_t i = kKeep; i < files.size(); ++i)
-    if (unlink((dir + "/" + files[i].name).c_str()) != 0)
-      LogError("Cannot remove %s/%s: %s", dir, files[i].name, std::strerror(errno));
+    if (!dir->Unlink(files[i].name)) LogError("Cannot remove %s/%s: %s", path, files[i].name, std::strerror(errno));
 }
 
 void notify_post(std::string_view name) {
-  const std::string dir = Context::Current().Path("/var/run");
-  if (!MakeDirectories(dir)) {
-    LogError("Cannot create %s: %s", dir, std::strerror(errno));
-    return;
-  }
   const std::string line = cf::ISO8601(cf::Date{Now()}) + " " + std::string(name) + "\n";
-  const int fd = open((dir + "/notifications.log").c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
-  if (fd < 0 || write(fd, line.data(), line.size()) != static_cast<ssize_t>(line.size()))
-    LogError("Cannot post notification %s: %s", std::string(name), std::strerror(errno));
-  if (fd >= 0) close(fd);
+  std::string error;
+  if (!AppendToFile(Context::Current().Path("/var/run/notifications.log"), line, &error))
+    LogError("Cannot post notification %s: %s", std::string(name), error);
 }
 
 std::string CC_MD5(std::string_view bytes) {

@@ -134,27 +134,6 @@ TEST_F(PrefsTest, BadFileReadsEmptyWithOneErrorAndIsOnlyReplacedByAWrite) {
   EXPECT_FALSE(FileExists(root / "Library/escape.plist"));
 }
 
-TEST_F(PrefsTest, CrashBeforeRenameLeavesTheOldFile) {
-  DGVPreferencesSetValue("v", cf::Value::SInt32(1), kDomain);
-  ASSERT_TRUE(DGVPreferencesSynchronize(kDomain));
-  const std::string before = *ReadFile(file);
-
-  const pid_t child = fork();
-  ASSERT_GE(child, 0);
-  if (child == 0) {
-    testing::g_before_rename_hook = [](const std::string&) { _exit(3); };
-    DGVPreferencesSetValue("v", cf::Value::SInt32(2), kDomain);
-    DGVPreferencesSynchronize(kDomain);
-    _exit(0);  // not reached
-  }
-  int status = 0;
-  waitpid(child, &status, 0);
-  ASSERT_TRUE(WIFEXITED(status));
-  ASSERT_EQ(WEXITSTATUS(status), 3);  // the crash happened where we wanted it
-  EXPECT_EQ(*ReadFile(file), before);
-  EXPECT_EQ(DGVPreferencesGetIntegerValue("v", kDomain), 1);
-}
-
 TEST(PrefsExitTest, PendingChangesAreWrittenAtNormalExit) {
   TempDir root;
   const pid_t child = fork();

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <fcntl.h>
+#include <grp.h>
 #include <poll.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -17,8 +18,11 @@ struct RunResult {
   std::string err;
 };
 
+// With a uid, the program runs as that user and group (the caller must be
+// able to switch).
 inline RunResult RunProgram(const std::string& program, const std::vector<std::string>& args,
-                            const std::map<std::string, std::string>& env) {
+                            const std::map<std::string, std::string>& env, uid_t uid = static_cast<uid_t>(-1),
+                            gid_t gid = static_cast<gid_t>(-1)) {
   int out_pipe[2], err_pipe[2];
   RunResult r;
   if (pipe(out_pipe) != 0 || pipe(err_pipe) != 0) return r;
@@ -29,6 +33,7 @@ inline RunResult RunProgram(const std::string& program, const std::vector<std::s
     close(out_pipe[0]);
     close(err_pipe[0]);
     for (const auto& [k, v] : env) setenv(k.c_str(), v.c_str(), 1);
+    if (uid != static_cast<uid_t>(-1) && (setgroups(0, nullptr) != 0 || setgid(gid) != 0 || setuid(uid) != 0)) _exit(126);
     std::vector<char*> argv{const_cast<char*>(program.c_str())};
     for (const auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
     argv.push_back(nullptr);

@@ -1,6 +1,7 @@
 // The daily job as a process: modes, gate, report, OS changes and the
 // service's messages, in a fresh device root made by devsim.
 #include <set>
+#include <thread>
 
 #include "root_fixture.h"
 
@@ -58,6 +59,32 @@ TEST_F(TallyrunTest, GatedRunHappensOncePerDay) {
   env["TALLYRUN_NOW"] = "2026-11-23T09:00:00Z";
   EXPECT_EQ(Count(Tallyrun({"-d"}).err, "daily tasks for day 20779"), 1u);
   EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday));
+}
+
+TEST_F(TallyrunTest, OneInstanceAtATime) {
+  // Three gated runs at once: the first does the day, the others wait for it
+  // and then find the day recorded.
+  std::vector<std::thread> runs;
+  std::vector<RunResult> results(3);
+  for (size_t i = 0; i < results.size(); ++i) runs.emplace_back([&, i] { results[i] = Tallyrun({"-d"}); });
+  for (auto& t : runs) t.join();
+  EXPECT_EQ(Logs().size(), 1u);
+  size_t unchanged = 0;
+  for (const RunResult& r : results) unchanged += Count(r.err, "Day unchanged since last run");
+  EXPECT_EQ(unchanged, 2u);
+
+  // A service finds another one serving: it leaves, and the first keeps its socket.
+  const std::string socket = root / "var/run/com.velmora.tallybookd.tallyrun.sock";
+  env["TALLYRUN_SERVICE_IDLE_SECONDS"] = "3";
+  std::thread first([&] { results[0] = Tallyrun({}); });
+  for (int i = 0; i < 500 && !platform::FileExists(socket); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  ASSERT_TRUE(platform::FileExists(socket));
+  const RunResult second = Tallyrun({});
+  EXPECT_EQ(Count(second.err, "<default>: Another tallyrun is running; leaving the work to it\n"), 1u);
+  EXPECT_TRUE(platform::FileExists(socket));
+  EXPECT_EQ(Tallyctl({"logging-status"}).status, 0);  // the first still answers
+  first.join();
+  EXPECT_FALSE(platform::FileExists(socket));
 }
 
 TEST_F(TallyrunTest, ALogHoldsItsOwnDayOnly) {

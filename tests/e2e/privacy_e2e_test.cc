@@ -1,0 +1,163 @@
+// What the job leaves under the root is private to the root's owner, code is
+// loaded only when nobody else could have written it, and no write goes
+// through a link planted in the root.
+#include <grp.h>
+#include <pwd.h>
+#include <sys/stat.h>
+
+#include "root_fixture.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+class PrivacyTest : public RootTest {
+ protected:
+  struct Entry {
+    std::string path;
+    mode_t mode;
+    gid_t gid;
+    bool dir;
+  };
+  std::vector<Entry> Everything() {
+    std::vector<Entry> out;
+    struct stat st;
+    for (const auto& e : fs::recursive_directory_iterator(root.path())) {
+      if (lstat(e.path().c_str(), &st) != 0 || S_ISLNK(st.st_mode)) continue;
+      out.push_back({e.path(), st.st_mode & 07777, st.st_gid, S_ISDIR(st.st_mode)});
+    }
+    return out;
+  }
+  const std::string library = root / "System/Library/PrivateFrameworks/FaultkeepSupport.framework/FaultkeepSupport";
+};
+
+TEST_F(PrivacyTest, EverythingCreatedIsPrivateWhateverTheUmask) {
+  // The fixture's devsim ran under the test's umask; run the job under 022.
+  const mode_t old = umask(022);
+  const RunResult r = Tallyrun({"-f"});
+  umask(old);
+  ASSERT_EQ(Logs().size(), 1u) << r.err;
+  size_t files = 0;
+  for (const Entry& e : Everything()) {
+    if (e.dir) {
+      EXPECT_EQ(e.mode, 0700u) << e.path;
+    } else {
+      ++files;
+      EXPECT_EQ(e.mode, e.path == library ? 0700u : 0600u) << e.path;
+    }
+  }
+  EXPECT_GT(files, 10u);  // the store, its journal, logs, preferences, events ...
+  EXPECT_EQ(Count(r.err, "Tightened"), 0u);
+
+  // A root made by an older version is tightened on the next run, a line per path.
+  const std::string prefs = root / "Library/Preferences";
+  ASSERT_EQ(chmod(prefs.c_str(), 0755), 0);
+  ASSERT_EQ(chmod(Logs()[0].c_str(), 0644), 0);
+  const RunResult again = Tallyrun({"-f"});
+  EXPECT_EQ(Count(again.err, "<default>: Tightened " + prefs + " from 0755 to 0700\n"), 1u);
+  EXPECT_EQ(Count(again.err, "<default>: Tightened " + Logs()[0] + " from 0644 to 0600\n"), 1u);
+  for (const Entry& e : Everything()) EXPECT_EQ(e.mode & 077, 0u) << e.path;
+}
+
+TEST_F(PrivacyTest, AGroupNamedByTheDeploymentMayRead) {
+  struct group* g = getgrgid(getegid());
+  ASSERT_NE(g, nullptr);
+  env["TALLYRUN_GROUP"] = g->gr_name;
+  TempDir fresh;
+  env["TALLYRUN_ROOT"] = fresh.path() + "/root";
+  ASSERT_EQ(RunProgram(DEVSIM_BIN, {"init", fresh.path() + "/root"}, env).status, 0);
+  const RunResult r = Tallyrun({"-f"});
+  struct stat st;
+  size_t checked = 0;
+  for (const auto& e : fs::recursive_directory_iterator(fresh.path() + "/root")) {
+    ASSERT_EQ(lstat(e.path().c_str(), &st), 0);
+    const bool is_library = e.path().filename() == "FaultkeepSupport";
+    EXPECT_EQ(st.st_mode & 07777, S_ISDIR(st.st_mode) ? 0750u : (is_library ? 0740u : 0640u)) << e.path();
+    EXPECT_EQ(st.st_gid, g->gr_gid) << e.path();
+    ++checked;
+  }
+  EXPECT_GT(checked, 20u) << r.err;
+}
+
+TEST_F(PrivacyTest, CodeOthersCouldWriteIsNotLoaded) {
+  for (const std::string& writable : {library, fs::path(library).parent_path().string()}) {
+    SCOPED_TRACE(writable);
+    struct stat st;
+    ASSERT_EQ(stat(writable.c_str(), &st), 0);
+    ASSERT_EQ(chmod(writable.c_str(), (st.st_mode & 07777) | 0020), 0);
+    const size_t before = Logs().size();
+    const RunResult r = Tallyrun({"-f"});
+    EXPECT_EQ(Count(r.err, "<error>: Not loading " + library + ": " + writable +
+                               " is writable by its group or by others\n"),
+              1u)
+        << r.err;
+    EXPECT_EQ(Count(r.err, "Failed to dynamically load the FaultkeepSupport framework"), 1u);
+    ASSERT_EQ(Logs().size(), before + 1);  // the log is still written
+    const cf::Value* corruptions = LastLog().Get("TBScalars").AsDictionary()->Find(
+        cf::Value("com.velmora.diagvault.tbkd.database.corruptions"));
+    if (corruptions) {
+      EXPECT_EQ(*corruptions, cf::Value::SInt64(0));
+    }
+    ASSERT_EQ(chmod(writable.c_str(), st.st_mode & 07777), 0);  // not touched by the run
+  }
+  // Trusted again: loaded without a word.
+  EXPECT_EQ(Count(Tallyrun({"-f"}).err, "Not loading"), 0u);
+}
+
+TEST_F(PrivacyTest, LinksPlantedInTheRootAreNeverWrittenThrough) {
+  TempDir outside;
+  const std::string target = outside / "target";
+  ASSERT_TRUE(platform::WriteFileAtomically(target, "untouched"));
+  const std::string events = root / "var/eventlens/events.jsonl";
+  const std::string prefs = root / ("Library/Preferences/" + kDomain + ".plist");
+  fs::remove(events);
+  fs::remove(prefs);
+  fs::create_directories(fs::path(events).parent_path());
+  fs::create_directories(fs::path(prefs).parent_path());
+  fs::create_symlink(target, events);
+  fs::create_symlink(target, prefs);
+  // A directory on the way that is a link: nothing may land in it.
+  fs::remove_all(root / "var/run");
+  fs::create_directory(outside / "run");
+  fs::create_directory_symlink(outside / "run", root / "var/run");
+
+  const RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, events + " is a symbolic link; refusing to write through it"), 1u) << r.err;
+  EXPECT_GE(Count(r.err, prefs + " is a symbolic link; refusing to replace it"), 1u);
+  EXPECT_EQ(Count(r.err, "<default>: tallyrun ended\n"), 1u);
+  EXPECT_EQ(Logs().size(), 1u);  // the rest of the run completed
+  EXPECT_EQ(*platform::ReadFile(target), "untouched");
+  EXPECT_TRUE(fs::is_empty(outside / "run"));
+  EXPECT_TRUE(fs::is_symlink(events));
+  EXPECT_TRUE(fs::is_symlink(prefs));
+}
+
+TEST_F(PrivacyTest, AnUnprivilegedUserRunsTheWholeJobOnItsOwnRoot) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to switch to an unprivileged user; this runs as uid " << geteuid();
+  struct passwd* nobody = getpwnam("nobody");
+  if (!nobody) GTEST_SKIP() << "no user 'nobody' on this machine";
+  TempDir home;
+  const std::string user_root = home / "root";
+  ASSERT_EQ(chown(home.path().c_str(), nobody->pw_uid, nobody->pw_gid), 0);
+  auto as_nobody = [&](const std::string& program, const std::vector<std::string>& args) {
+    auto e = env;
+    e["TALLYRUN_ROOT"] = user_root;
+    return RunProgram(program, args, e, nobody->pw_uid, nobody->pw_gid);
+  };
+  const RunResult init = as_nobody(DEVSIM_BIN, {"init", user_root});
+  ASSERT_EQ(init.status, 0) << init.err;
+  const RunResult r = as_nobody(TALLYRUN_BIN, {"-f"});
+  EXPECT_EQ(Count(r.err, "Not loading"), 0u) << r.err;
+  EXPECT_EQ(Count(r.err, "<error>"), 0u) << r.err;
+  size_t logs = 0;
+  struct stat st;
+  for (const auto& e : fs::recursive_directory_iterator(user_root)) {
+    ASSERT_EQ(lstat(e.path().c_str(), &st), 0);
+    EXPECT_EQ(st.st_uid, nobody->pw_uid) << e.path();
+    EXPECT_EQ(st.st_mode & 077, 0u) << e.path();
+    logs += e.path().extension() == ".193";
+  }
+  EXPECT_EQ(logs, 1u);
+}
+
+}  // namespace
