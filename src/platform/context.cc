@@ -3,6 +3,7 @@
 #include <cstdlib>
 
 #include "platform/clock.h"
+#include "platform/device_model.h"
 #include "platform/log.h"
 #include "platform/prefs.h"
 #include "platform/store.h"
@@ -58,6 +59,11 @@ void Context::SynchronizeAllPreferences() {
 }
 
 Context::~Context() = default;
+
+DeviceModel& Context::device() {
+  if (!device_) device_ = std::make_unique<DeviceModel>();
+  return *device_;
+}
 
 std::string Context::Path(std::string_view device_path) const {
   std::string out = root_ == "/" ? std::string() : root_;

@@ -12,6 +12,7 @@
 namespace platform {
 
 class Clock;
+class DeviceModel;
 class LogSink;
 class Preferences;
 class TallyStore;
@@ -51,6 +52,8 @@ class Context {
   // The store client's connection, opened on first use; null (with a reason
   // in *error) when the store cannot be opened.
   TallyStore* store(std::string* error = nullptr);
+  // The device registry and its open handles, made on first use.
+  DeviceModel& device();
 
  private:
   friend class ContextScope;
@@ -59,6 +62,7 @@ class Context {
   Backends backends_;
   std::map<std::string, std::unique_ptr<Preferences>> preference_stores_;
   std::unique_ptr<TallyStore> store_;
+  std::unique_ptr<DeviceModel> device_;
   std::string store_error_;
   bool store_tried_ = false;
 };

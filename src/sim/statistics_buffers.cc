@@ -108,6 +108,70 @@ std::string FixedSnapshotRecord(const std::vector<uint32_t>& words) {
   return record;
 }
 
+namespace {
+
+// The values of one field: a number, or an array of numbers.
+bool FieldValues(const cf::Value& name, const cf::Value& value, uint64_t max_value, std::vector<uint64_t>* out,
+                 std::string* error) {
+  auto one = [&](const cf::Value& v) {
+    const cf::Number* n = v.AsNumber();
+    if (!n || n->IsFloat() || (!n->IsUnsigned() && n->AsSInt64() < 0) || n->AsUInt64() > max_value) return false;
+    out->push_back(n->AsUInt64());
+    return true;
+  };
+  bool ok = true;
+  if (const cf::Array* a = value.AsArray()) {
+    for (const cf::Value& v : *a) ok = ok && one(v);
+  } else {
+    ok = one(value);
+  }
+  if (!ok && error) *error = "field \"" + name.Description() + "\": values must be integers from 0 to " + std::to_string(max_value);
+  return ok;
+}
+
+template <typename Field, typename Fields>
+const Field* ByName(const Fields& fields, const std::string& name) {
+  for (const Field& f : fields)
+    if (name == f.name) return &f;
+  return nullptr;
+}
+
+}  // namespace
+
+std::optional<std::string> EncodeFtlFields(const cf::Dictionary& fields, std::string* error) {
+  WordRecordBuffer b;
+  for (const auto& [name, value] : fields) {
+    const parsers::FtlField* f = name.AsString() ? ByName<parsers::FtlField>(parsers::FtlFields(), *name.AsString()) : nullptr;
+    if (!f) {
+      if (error) *error = "unknown FTL field \"" + name.Description() + "\"";
+      return std::nullopt;
+    }
+    std::vector<uint64_t> payload;
+    if (!FieldValues(name, value, UINT64_MAX, &payload, error)) return std::nullopt;
+    b.Record(f->key, payload);
+  }
+  return b.End().bytes();
+}
+
+std::optional<std::string> EncodeMspFields(const cf::Dictionary& fields, std::string* error) {
+  ByteRecordBuffer b;
+  for (const auto& [name, value] : fields) {
+    const parsers::MspField* f = name.AsString() ? ByName<parsers::MspField>(parsers::MspFields(), *name.AsString()) : nullptr;
+    if (!f) {
+      if (error) *error = "unknown MSP field \"" + name.Description() + "\"";
+      return std::nullopt;
+    }
+    std::vector<uint64_t> values;
+    if (!FieldValues(name, value, UINT32_MAX, &values, error)) return std::nullopt;
+    if (values.size() > 0xFFFF / 4) {
+      if (error) *error = "field \"" + name.Description() + "\": more values than a record holds";
+      return std::nullopt;
+    }
+    b.Record(static_cast<uint16_t>(f->key), std::vector<uint32_t>(values.begin(), values.end()));
+  }
+  return b.End().bytes();
+}
+
 std::string CompleteFtlBuffer() {
   WordRecordBuffer b;
   uint64_t v = 1000;

@@ -3,8 +3,11 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
+
+#include "cf/value.h"
 
 namespace sim {
 
@@ -78,6 +81,14 @@ class SnapshotBuilder {
 
 // One record of the fixed 63-word snapshot layout.
 std::string FixedSnapshotRecord(const std::vector<uint32_t>& words);
+
+// Buffers described field by field, as a person writes them in
+// controller.plist: field name -> number, or an array of numbers (one
+// element each), in the dictionary's order. Nothing (reason in *error) for
+// an unknown name, a value that is not a non-negative integer, or more
+// values than a record can hold.
+std::optional<std::string> EncodeFtlFields(const cf::Dictionary& fields, std::string* error);
+std::optional<std::string> EncodeMspFields(const cf::Dictionary& fields, std::string* error);
 
 // A complete FTL buffer: every field of the table once, arrays at their full
 // count, values that differ from field to field, then the end marker.

@@ -1,0 +1,12 @@
+// The user-client kinds of the simulated device, one factory each.
+#pragma once
+
+#include <memory>
+
+#include "sim/device.h"
+
+namespace sim {
+
+std::unique_ptr<UserClient> CreateNvmeClient(const Service& service, DeviceFiles& files);
+
+}  // namespace sim
