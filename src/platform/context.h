@@ -22,6 +22,8 @@ struct Backends {
   std::shared_ptr<LogSink> log;  // default: syslog (mirrored to stderr on request)
   // False models a device without the analytics library (weakly linked).
   bool analytics_available = true;
+  // False models a device without the purgeable-space service (weakly linked).
+  bool purgewell_available = true;
 };
 
 class Context {
@@ -49,6 +51,7 @@ class Context {
   Preferences& PreferencesAt(const std::string& device_dir);
   void SynchronizeAllPreferences();
   bool analytics_available() const { return backends_.analytics_available; }
+  bool purgewell_available() const { return backends_.purgewell_available; }
   // The store client's connection, opened on first use; null (with a reason
   // in *error) when the store cannot be opened.
   TallyStore* store(std::string* error = nullptr);

@@ -5,6 +5,7 @@
 #include <fcntl.h>
 #include <openssl/evp.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -155,7 +156,17 @@ std::string DGVOSVersion() {
 }
 
 cf::Value DVCopyAnswer(std::string_view question) {
-  return ReadProfileDictionary("/device/answers.plist").Get(std::string(question));
+  const cf::Dictionary answers = ReadProfileDictionary("/device/answers.plist");
+  const cf::Value* answer = answers.Find(cf::Value(std::string(question)));
+  if (question != kDVQDiskUsage) return answer ? *answer : cf::Value();
+  if (answer) return answer->AsBool() && !*answer->AsBool() ? cf::Value() : *answer;
+  // Measured on the filesystem that holds the root.
+  struct statvfs fs;
+  if (statvfs(Context::Current().root().c_str(), &fs) != 0) return {};
+  cf::Dictionary usage;
+  usage.Set(kDVQDiskUsageTotalDiskCapacity, cf::Value::SInt64(static_cast<int64_t>(fs.f_blocks * fs.f_frsize)));
+  usage.Set(kDVQDiskUsageTotalDataAvailable, cf::Value::SInt64(static_cast<int64_t>(fs.f_bavail * fs.f_frsize)));
+  return usage;
 }
 
 namespace {

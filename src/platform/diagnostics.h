@@ -37,8 +37,13 @@ std::string DGVOSVersion();
 bool DiagnosticLogSubmissionEnabled();
 // A boolean answer of $ROOT/device/answers.plist; false when absent.
 bool DVGetBoolAnswer(std::string_view question);
-// Any answer of $ROOT/device/answers.plist; null when absent.
+// The answer to a device-property question from $ROOT/device/answers.plist,
+// or null. "DiskUsage" without an entry there is measured with statvfs of
+// the root; "DiskUsage" = false means the device gives no answer.
 cf::Value DVCopyAnswer(std::string_view question);
+inline constexpr const char* kDVQDiskUsage = "DiskUsage";
+inline constexpr const char* kDVQDiskUsageTotalDiskCapacity = "TotalDiskCapacity";
+inline constexpr const char* kDVQDiskUsageTotalDataAvailable = "TotalDataAvailable";
 
 // Moves structured-data log files last written before today from
 // $ROOT/var/faultkeep/ into $ROOT/var/faultkeep/old/. Never fails the caller.

@@ -32,9 +32,12 @@ int Fail(int error) {
   return -1;
 }
 
+// Bytes (data, or text with its NUL) go into any buffer at least as large;
+// the size becomes their length.
 int CopyOut(const void* bytes, size_t n, void* buffer, size_t* size) {
-  if (*size != n) return Fail(ENOMEM);
+  if (*size < n) return Fail(ENOMEM);
   std::memcpy(buffer, bytes, n);
+  *size = n;
   return 0;
 }
 
@@ -64,6 +67,7 @@ int Sysctl(const char* name, void* buffer, size_t* size) {
     return Fail(ENOMEM);
   }
   if (const cf::Data* d = v.AsData()) return CopyOut(d->data(), d->size(), buffer, size);
+  if (const std::string* text = v.AsString()) return CopyOut(text->c_str(), text->size() + 1, buffer, size);
   if (!v.IsNull()) return Fail(EINVAL);
 
   const std::string key = name;

@@ -15,12 +15,13 @@ cf::Value _CFCopySystemVersionDictionary();
 
 namespace platform {
 
-// sysctlbyname-style read of a kernel variable into a buffer of exactly
-// *size bytes. Values come from $ROOT/device/sysctl.plist (name -> integer,
-// read as 4 or 8 bytes, or data of one exact size); "vm.swapusage" and
-// "kern.bootsessionuuid" come from Linux unless the profile names them.
-// Returns 0, or -1 with errno: ENOENT for an unknown name, ENOMEM for a
-// size that does not match.
+// sysctlbyname-style read of a kernel variable into a buffer of *size bytes.
+// Values come from $ROOT/device/sysctl.plist: an integer is read as 4 or 8
+// bytes (the buffer's size); data, and a string with its terminating NUL, go
+// into any buffer at least as large, *size becoming their length.
+// "vm.swapusage" and "kern.bootsessionuuid" come from Linux unless the
+// profile names them. Returns 0, or -1 with errno: ENOENT for an unknown
+// name, ENOMEM for a buffer of the wrong size (too small for bytes).
 int Sysctl(const char* name, void* buffer, size_t* size);
 
 // The kernel's page size in bytes.

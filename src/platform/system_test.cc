@@ -35,12 +35,13 @@ class SystemTest : public ::testing::Test {
   }
 };
 
-TEST_F(SystemTest, KernelVariablesReadWithExactSizes) {
+TEST_F(SystemTest, KernelVariablesAndTheirSizes) {
   cf::Dictionary profile;
   profile.Set("kern.small", cf::Value::SInt64(7));
   profile.Set("kern.big", cf::Value::UInt64(0x1'0000'0000ull));
   profile.Set("kern.record", cf::Value::Bytes(cf::Data{1, 2, 3, 4, 5, 6}));
   profile.Set("vm.swapusage", cf::Value::Bytes(cf::Data(32, 0)));
+  profile.Set("kern.bootsessionuuid", "8F0C");
   Write("device/sysctl.plist", profile);
 
   uint32_t u32 = 0;
@@ -62,8 +63,20 @@ TEST_F(SystemTest, KernelVariablesReadWithExactSizes) {
   size = 6;
   EXPECT_EQ(Sysctl("kern.record", record, &size), 0);
   EXPECT_EQ(record[5], 6);
+  // Bytes go into any buffer at least as large, the size becoming theirs.
   size = 8;
-  EXPECT_EQ(Sysctl("kern.record", &u64, &size), -1);
+  EXPECT_EQ(Sysctl("kern.record", &u64, &size), 0);
+  EXPECT_EQ(size, 6u);
+  size = 5;
+  EXPECT_EQ(Sysctl("kern.record", record, &size), -1);
+  EXPECT_EQ(errno, ENOMEM);
+  char text[100] = {'x'};
+  size = sizeof text;
+  EXPECT_EQ(Sysctl("kern.bootsessionuuid", text, &size), 0);
+  EXPECT_EQ(size, 5u);  // the NUL counts
+  EXPECT_STREQ(text, "8F0C");
+  size = 4;
+  EXPECT_EQ(Sysctl("kern.bootsessionuuid", text, &size), -1);
   EXPECT_EQ(errno, ENOMEM);
   size = 2;
   EXPECT_EQ(Sysctl("kern.small", &u32, &size), -1);
