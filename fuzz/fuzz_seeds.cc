@@ -6,6 +6,7 @@
 
 #include "cf/plist.h"
 #include "platform/service.h"
+#include "sim/kcdata.h"
 #include "sim/statistics_buffers.h"
 
 namespace {
@@ -70,5 +71,40 @@ int main(int argc, char** argv) {
   cf::WriteXMLPropertyList(message, bytes, nullptr);
   Seed("plist", "message.xml", bytes);
   Seed("plist", "message.json", R"({"operation": 2, "app_data": [{"bundle_id": "x", "adam_id": -1}]})");
+
+  // Stackshots: the encoder's layout, then the shapes the search must survive.
+  auto thread = [](const char* name, int64_t writes) {
+    cf::Dictionary t;
+    t.Set("name", name);
+    if (writes >= 0) t.Set("diskWrites", cf::Value::SInt64(writes));
+    return cf::Value(t);
+  };
+  auto task = [](const char* name, std::vector<cf::Value> threads) {
+    cf::Dictionary t;
+    t.Set("name", name);
+    t.Set("threads", cf::Array(std::move(threads)));
+    return cf::Value(t);
+  };
+  const cf::Array tasks({task("launchd", {thread("main", 512)}),
+                         task("kernel_task", {thread("idle", -1), thread("VM_swapout", 4096)})});
+  const std::string stackshot = *sim::EncodeKCDataStackshot(tasks, nullptr);
+  Seed("kcdata", "stackshot", stackshot);
+  Seed("kcdata", "truncated", stackshot.substr(0, stackshot.size() - 60));
+  Seed("kcdata", "no-stats", *sim::EncodeKCDataStackshot(cf::Array({task("k", {thread("VM_swapout", -1)})}), nullptr));
+  sim::KCDataBuilder second;
+  second.Begin(1).Begin(3).ThreadName("other").IOStats(1).End(3).End(1).Begin(2).Begin(4).ThreadName("VM_swapout")
+      .IOStats(4096).End(4).End(2).BufferEnd();
+  Seed("kcdata", "second-container", second.bytes());
+  sim::KCDataBuilder odd_items;
+  odd_items.Item(0x2A, std::string(20, 'a')).Item(0x13, "ab", 7).Begin(1).IOStats(9).Begin(2).ThreadName("VM", 2)
+      .IOStatsFields({1, 2, 3}).End(1 + (1ull << 32)).End(2).Item(0x20, second.bytes()).End(1).BufferEnd();
+  Seed("kcdata", "odd-items", odd_items.bytes());
+  sim::KCDataBuilder wrapping;
+  wrapping.Begin(1).ThreadName("VM_swapout").Header(0x901, 0xFFFFFFFF).IOStats(1);
+  Seed("kcdata", "wrapping-size", wrapping.bytes());
+  sim::KCDataBuilder deep;
+  for (uint64_t id = 1; id <= 70; ++id) deep.Begin(id);
+  deep.ThreadName("VM_swapout").IOStats(64);
+  Seed("kcdata", "deep", deep.bytes());
   return 0;
 }
