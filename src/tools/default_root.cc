@@ -193,7 +193,15 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
   version.Set("ProductVersion", "4.2");
   version.Set("ProductBuildVersion", "22C41");
   if (!WritePlist(c.Path("/device/system-version.plist"), version, error)) return false;
-  if (!WritePlist(c.Path("/device/sysctl.plist"), SysctlProfile(), error)) return false;
+  const DefaultDevice device = StorageDevice();
+  cf::Dictionary sysctl = SysctlProfile();
+  sysctl.Set("kern.bootsessionuuid", device.boot_session_uuid);
+  if (!WritePlist(c.Path("/device/sysctl.plist"), sysctl, error) ||
+      !WritePlist(c.Path("/device/registry.plist"), device.registry, error) ||
+      !WritePlist(c.Path("/device/controller.plist"), device.controller, error) ||
+      !WritePlist(c.Path("/device/stackshot.plist"), device.stackshot, error) ||
+      !WritePlist(c.Path("/device/purgeable.plist"), device.purgeable, error))
+    return false;
   if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
   if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), cf::Array({cf::Value("com.velmora.homedeck.appInstalls")}),
                   error))

@@ -11,6 +11,9 @@
 #include "parsers/parsers.h"
 #include "tools/cli.h"
 #include "platform/files.h"
+#include "cf/plist.h"
+#include "nandinfo/nandinfo.h"
+#include "platform/context.h"
 #include "tools/default_root.h"
 
 namespace {
@@ -87,6 +90,28 @@ std::string SupportLibrary() {
   return FAULTKEEP_SUPPORT_LIBRARY;
 }
 
+// The NAND info dictionary of the root's controller with the memory
+// freezer's writes, as the daily collection would store them.
+int Controller(const std::string& root) {
+  platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  cf::Dictionary info;
+  const cf::Value nand = CopyNANDInfo();
+  if (const cf::Dictionary* d = nand.AsDictionary()) info = d->MutableCopy();
+  for (const auto& [key, value] : CopyVMFreezerNANDInfo()) info.Set(key, value);
+  std::string json, error;
+  if (!cf::WriteJSON(info, json, &error, 2)) {
+    std::fprintf(stderr, "devsim: %s\n", error.c_str());
+    return 1;
+  }
+  std::printf("%s\n", json.c_str());
+  if (info.Contains("com.velmora.NANDInfo.Error")) {
+    std::fprintf(stderr, "devsim: the controller of %s could not be read: %s\n", scope.context().root().c_str(),
+                 GetAPIErrorMessage().c_str());
+    return 1;
+  }
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -101,12 +126,16 @@ int main(int argc, char** argv) {
   auto* parse = app.add_subcommand("parse", "Parse a raw statistics buffer: one 'name value' line per pair");
   parse->add_option("KIND", kind, "ftl, stats or msp")->required()->check(CLI::IsMember({"ftl", "stats", "msp"}));
   parse->add_option("FILE", file)->required();
+  std::string controller_root;
+  auto* controller = app.add_subcommand("controller", "Print the NAND info a root's controller gives, as JSON");
+  controller->add_option("ROOT", controller_root, "the device root (default: TALLYRUN_ROOT)");
   auto* snapshot = app.add_subcommand("snapshot", "Print a snapshot buffer as text");
   snapshot->add_option("FILE", file)->required();
   snapshot->add_option("--header", header_file, "the snapshot header, for the descriptor-driven form");
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
   if (parse->parsed()) return Parse(kind, file);
   if (snapshot->parsed()) return Snapshot(file, header_file);
+  if (controller->parsed()) return Controller(controller_root);
   if (init->parsed()) {
     std::error_code ec;
     if (std::filesystem::exists(dir, ec) && !std::filesystem::is_directory(dir, ec)) {
