@@ -27,23 +27,78 @@ class FtlTest : public ::testing::Test {
   }
 };
 
-TEST_F(FtlTest, CompleteBufferYieldsEveryValue) {
-  const std::string buffer = sim::CompleteFtlBuffer();
-  GenericParserCxt c;
-  EXPECT_EQ(VSPFTLParseBufferToCxt(&c, buffer.data(), static_cast<uint32_t>(buffer.size())), 2156u);
-  ASSERT_EQ(c.pairs.size(), 2156u);
-  EXPECT_EQ(c.pairs[0].name, "version");
-  EXPECT_EQ(c.pairs[0].value, 1000u);
-  EXPECT_EQ(GetAPIErrorMessage(), "NA");
-  VSPParseCxt s;
-  // The full statistics parse has no end marker: the marker's record is just
-  // skipped, and the buffer ends exactly after it.
-  EXPECT_EQ(VSPParseBufferToCxt(&s, buffer.data(), static_cast<uint32_t>(buffer.size())), 1u);
-  EXPECT_EQ(s.pairs.size(), 2156u);
-  EXPECT_EQ(s.driverVersion, 0xFFFFFFFFu);
-  VSPReleaseContext(&s);
-  EXPECT_TRUE(s.pairs.empty());
-  EXPECT_EQ(s.driverVersion, 0u);
+// Each fixed field of the full statistics context comes from its own key.
+// Keys and names are written out here rather than taken from the field
+// table, and each key gets a value of its own, so two swapped fields fail.
+TEST_F(FtlTest, StatsFixedFieldsByKey) {
+  struct Fixed {
+    uint32_t key;
+    const char* name;
+    uint64_t (*get)(const VSPParseCxt&);
+    bool low_32_bits;
+  };
+#define FIXED(key, field, narrow) {key, #field, [](const VSPParseCxt& c) -> uint64_t { return c.field; }, narrow}
+  const Fixed fixed[] = {
+      FIXED(4, hostWrites, false),
+      FIXED(7, hostReads, false),
+      FIXED(12, IND_pool_free, false),
+      FIXED(13, IND_pool_count, false),
+      FIXED(17, wearLevMoves, false),
+      FIXED(18, nandWrites, false),
+      FIXED(19, nandReads, false),
+      FIXED(20, bandErases, false),
+      FIXED(28, numSleepOps, false),
+      FIXED(45, maxHighEnduranceBlockErases, false),
+      FIXED(48, numFreeVirtualBlocks, false),
+      FIXED(49, bytesPerPage, true),
+      FIXED(50, pagesPerVirtualBlock, true),
+      FIXED(51, blocksPerVirtualBlock, true),
+      FIXED(52, numVirtualBlocks, true),
+      FIXED(53, exportVersion, true),
+      FIXED(56, utilFormatTime, false),
+  };
+#undef FIXED
+  ASSERT_EQ(std::size(fixed), 17u);
+  // Distinct in both halves, so the 32-bit fields differ too.
+  auto value = [](uint32_t key) { return (uint64_t{0xAB00 + key} << 32) | (0x5000 + key); };
+  auto expected = [&](const Fixed& f) { return f.low_32_bits ? value(f.key) & 0xFFFFFFFF : value(f.key); };
+
+  // One key at a time: its field and no other.
+  for (const Fixed& f : fixed) {
+    WordRecordBuffer b;
+    b.Record(f.key, {value(f.key)});
+    VSPParseCxt c;
+    ASSERT_EQ(Stats(c, b), 1u) << f.name;
+    for (const Fixed& g : fixed) EXPECT_EQ(g.get(c), &g == &f ? expected(f) : 0u) << f.name << " -> " << g.name;
+    for (uint64_t h : c.readCountHisto) EXPECT_EQ(h, 0u) << f.name;
+    ASSERT_EQ(c.pairs.size(), 1u);
+    EXPECT_EQ(c.pairs[0].name, f.name);
+    EXPECT_EQ(c.pairs[0].value, value(f.key));  // the pair keeps all 64 bits
+  }
+
+  // All together with readCountHisto (key 265, five elements; extra words
+  // are not stored), a key that has no fixed field, and the FTL end marker,
+  // which this parse does not know: the record after it is read.
+  WordRecordBuffer all;
+  for (const Fixed& f : fixed) all.Record(f.key, {value(f.key)});
+  all.Record(265, {71, 72, 73, 74, 75, 76, 77}).Record(16, {99}).End().Record(2, {98});
+  VSPParseCxt c;
+  ASSERT_EQ(Stats(c, all), 1u);
+  for (const Fixed& f : fixed) EXPECT_EQ(f.get(c), expected(f)) << f.name;
+  for (size_t i = 0; i < 5; ++i) EXPECT_EQ(c.readCountHisto[i], 71 + i) << i;
+  EXPECT_EQ(c.driverVersion, 0xFFFFFFFFu);
+  ASSERT_EQ(c.pairs.size(), 17u + 5u + 2u);
+  EXPECT_EQ(c.pairs[17].name, "readCountHisto0");
+  EXPECT_EQ(c.pairs[21].name, "readCountHisto4");
+  EXPECT_EQ(c.pairs[22].name, "gcWrites");
+  EXPECT_EQ(c.pairs[23].name, "hostWriteXacts");
+
+  // Release empties the pairs and zeroes every fixed field.
+  VSPReleaseContext(&c);
+  EXPECT_TRUE(c.pairs.empty());
+  for (const Fixed& f : fixed) EXPECT_EQ(f.get(c), 0u) << f.name;
+  for (uint64_t h : c.readCountHisto) EXPECT_EQ(h, 0u);
+  EXPECT_EQ(c.driverVersion, 0u);
 }
 
 TEST_F(FtlTest, EndRulesAndSkipping) {

@@ -19,17 +19,6 @@ class MspTest : public ::testing::Test {
   }
 };
 
-TEST_F(MspTest, CompleteBufferAndNames) {
-  const std::string buffer = sim::CompleteMspBuffer();
-  GenericParserCxt c;
-  EXPECT_EQ(VSPMSPParseBufferToCxt(&c, buffer.data(), static_cast<uint32_t>(buffer.size())), 254u);
-  EXPECT_EQ(c.pairs[0].name, "passWithTmodeHard");
-  bool found = false;
-  for (const auto& p : c.pairs) found |= p.name == "lower_die_temperature15";
-  EXPECT_TRUE(found);
-  EXPECT_EQ(GetAPIErrorMessage(), "NA");
-}
-
 TEST_F(MspTest, FillersEndMarkerAndUnknownKeys) {
   GenericParserCxt c;
   ByteRecordBuffer only_fillers;
