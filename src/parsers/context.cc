@@ -14,19 +14,33 @@ std::string* g_api_error = nullptr;  // null until the first message
 
 std::string ParserPairValueText(const ParserPair& pair) { return std::to_string(pair.value); }
 
+namespace {
+
+// The test hook's stand-in for an exhausted heap: throws where an
+// allocation would.
+void ChargeOneAdd() {
+  int64_t& budget = parsers::testing::g_adds_before_failure;
+  if (budget == 0) throw std::bad_alloc();
+  if (budget > 0) --budget;
+}
+
+void AppendPair(GenericParserCxt& context, const char* prefix, const char* name, uint64_t value) {
+  ChargeOneAdd();
+  const size_t prefix_length = prefix ? std::strlen(prefix) : 0;
+  const size_t name_length = name ? std::strlen(name) : 0;
+  std::string full;
+  full.reserve(std::min(kMaxParserNameLength, prefix_length + name_length));
+  full.append(prefix ? prefix : "", std::min(prefix_length, kMaxParserNameLength));
+  full.append(name ? name : "", std::min(name_length, kMaxParserNameLength - full.size()));
+  context.pairs.push_back({std::move(full), value});
+}
+
+}  // namespace
+
 int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix, const char* name, uint64_t value) {
   if (!context) return 0;
-  int64_t& budget = parsers::testing::g_adds_before_failure;
-  if (budget == 0) return 0;
-  if (budget > 0) --budget;
   try {
-    const size_t prefix_length = prefix ? std::strlen(prefix) : 0;
-    const size_t name_length = name ? std::strlen(name) : 0;
-    std::string full;
-    full.reserve(std::min(kMaxParserNameLength, prefix_length + name_length));
-    full.append(prefix ? prefix : "", std::min(prefix_length, kMaxParserNameLength));
-    full.append(name ? name : "", std::min(name_length, kMaxParserNameLength - full.size()));
-    context->pairs.push_back({std::move(full), value});
+    AppendPair(*context, prefix, name, value);
   } catch (const std::bad_alloc&) {
     return 0;
   }
@@ -36,7 +50,7 @@ int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix
 int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* name, const void* source,
                                       uint32_t elementSize, uint32_t count) {
   if (elementSize == 0 || count == 0) return 1;
-  if (elementSize > 8 || !source) return 0;
+  if (elementSize > 8 || !source || count > kMaxParserArrayElements) return 0;
   const auto* bytes = static_cast<const uint8_t*>(source);
   auto element = [&](uint32_t i) {
     uint64_t v = 0;
@@ -44,16 +58,21 @@ int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* nam
     return v;
   };
   if (count == 1) return AddSingleValueToGenericContext(context, "", name, element(0));
-  if (context) context->pairs.reserve(context->pairs.size() + count);
-  int ok = 1;
-  char index[8];
-  // The index is a 16-bit counter, as the controller's tools have it.
-  for (uint16_t i = 0; i < count; ++i) {
-    std::snprintf(index, sizeof index, "%d", i);
-    if (!AddSingleValueToGenericContext(context, name, index, element(i))) ok = 0;
-    if (i == UINT16_MAX) break;
+  if (!context) return 0;
+  // All or nothing: a failure takes back the pairs this call added.
+  const size_t before = context->pairs.size();
+  try {
+    context->pairs.reserve(before + count);
+    char index[8];
+    for (uint32_t i = 0; i < count; ++i) {
+      std::snprintf(index, sizeof index, "%u", i);
+      AppendPair(*context, name, index, element(i));
+    }
+  } catch (const std::bad_alloc&) {
+    context->pairs.erase(context->pairs.begin() + static_cast<ptrdiff_t>(before), context->pairs.end());
+    return 0;
   }
-  return ok;
+  return 1;
 }
 
 void ReservePairs(GenericParserCxt& context, uint64_t max_values) {

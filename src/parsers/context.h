@@ -52,10 +52,14 @@ inline constexpr size_t kMaxParserNameLength = 98;
 // Appends (prefix + name, cut to 98 characters; value). 1 on success, 0 on
 // failure (a null context, or no memory).
 int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix, const char* name, uint64_t value);
+// The most elements one array add takes: its index counts in 16 bits.
+inline constexpr uint32_t kMaxParserArrayElements = 65536;
+
 // Appends count elements of elementSize bytes (each zero-extended to 64
 // bits): one pair under the bare name when count is 1, else name0, name1, ...
-// 1 when every element was added (and when there was nothing to add); 0 for
-// elements wider than 8 bytes or when an add failed.
+// 1 when every element was added (and when there was nothing to add). 0 for
+// elements wider than 8 bytes, more than kMaxParserArrayElements elements or
+// no memory; a call that fails adds nothing.
 int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* name, const void* source,
                                       uint32_t elementSize, uint32_t count);
 // Frees every pair and empties the context; harmless on an empty context.

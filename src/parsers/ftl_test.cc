@@ -214,11 +214,55 @@ TEST_F(FtlTest, AddFailures) {
   WordRecordBuffer arrays;
   arrays.Record(14, std::vector<uint64_t>(10, 1)).Record(2, {2});
   EXPECT_EQ(Ftl(c, arrays), 0u);
-  EXPECT_EQ(c.pairs.size(), 2u);  // what was added before the failure stays
+  EXPECT_TRUE(c.pairs.empty());  // no partial run of the failed array
   EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): Cannot add 10 elements to context");
   // The first message of the process wins.
   SetAPIErrorMessage("later %d", 1);
   EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): Cannot add 10 elements to context");
+}
+
+// An array add is all or nothing: a call that fails leaves the context as it
+// was before the call (earlier pairs stay), and a count the 16-bit index
+// cannot name is refused before anything is added.
+TEST_F(FtlTest, ArrayAddsAllOrNothing) {
+  std::vector<uint64_t> source(65537);
+  for (size_t i = 0; i < source.size(); ++i) source[i] = i * 3;
+  struct Case {
+    const char* what;
+    uint32_t count;
+    int64_t adds_before_failure;
+    int result;
+    size_t added;
+  };
+  const Case cases[] = {
+      {"the largest count", 65536, -1, 1, 65536},
+      {"one past the 16-bit index", 65537, -1, 0, 0},
+      {"heap exhausted mid-array", 10, 4, 0, 0},
+      {"heap exhausted at the first element", 10, 0, 0, 0},
+      {"heap exhausted at the last element", 10, 9, 0, 0},
+      {"heap holds exactly the array", 10, 10, 1, 10},
+      {"a single element without heap", 1, 0, 0, 0},
+      {"a count no heap could hold", UINT32_MAX, -1, 0, 0},
+  };
+  for (const Case& k : cases) {
+    GenericParserCxt c;
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, "", "before", 7), 1);
+    ASSERT_EQ(AddMultipleFieldsToGenericContext(&c, "pre", source.data(), 8, 3), 1);
+    parsers::testing::g_adds_before_failure = k.adds_before_failure;
+    EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "x", source.data(), 8, k.count), k.result) << k.what;
+    parsers::testing::g_adds_before_failure = -1;
+    EXPECT_EQ(c.pairs.size(), 4 + k.added) << k.what;
+    if (c.pairs.size() != 4 + k.added) continue;
+    EXPECT_EQ(c.pairs[3].name, "pre2") << k.what;
+    if (k.added > 0) {
+      EXPECT_EQ(c.pairs.back().name, "x" + std::to_string(k.added - 1)) << k.what;
+      EXPECT_EQ(c.pairs.back().value, (k.added - 1) * 3) << k.what;
+    }
+    // The context goes on from where it was.
+    EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "after", 1), 1);
+    EXPECT_EQ(c.pairs.back().name, "after");
+    EXPECT_EQ(c.pairs.size(), 5 + k.added) << k.what;
+  }
 }
 
 TEST_F(FtlTest, ContextOperations) {

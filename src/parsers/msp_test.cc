@@ -93,6 +93,7 @@ TEST_F(MspTest, LengthMismatches) {
   window.Record(8193, {1, 2, 3, 4, 5}).Record(4096, {1});
   parsers::testing::g_adds_before_failure = 3;
   EXPECT_EQ(Parse(c, window), 0u);
+  EXPECT_TRUE(c.pairs.empty());  // no partial run of the failed array
   EXPECT_EQ(GetAPIErrorMessage(), "VSPMSPParseBufferToCxt: avg_rd_window_size(8193): Error adding 5 elements to context");
   parsers::testing::ResetAPIErrorMessage();
   parsers::testing::g_adds_before_failure = 0;
