@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <type_traits>
+
 #include "parsers/parsers.h"
 #include "sim/statistics_buffers.h"
 
@@ -16,7 +18,7 @@ class FtlTest : public ::testing::Test {
   void TearDown() override { parsers::testing::g_adds_before_failure = -1; }
   static std::vector<std::string> Names(const GenericParserCxt& c) {
     std::vector<std::string> out;
-    for (const auto& p : c.pairs) out.push_back(p.name);
+    for (const auto& p : c.pairs) out.emplace_back(p.name);
     return out;
   }
   static uint32_t Ftl(GenericParserCxt& c, const WordRecordBuffer& b) {
@@ -283,10 +285,64 @@ TEST_F(FtlTest, ContextOperations) {
   EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 0, 3), 1);
   EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 9, 1), 0);
   EXPECT_EQ(c.pairs.size(), 6u);
+
+  // The 98-character cut applies after the index: "n...n10" and "n...n11"
+  // both become "n...n1"; one element keeps the bare name.
+  const std::string n97(97, 'n');
+  const uint64_t twelve[12] = {};
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, n97.c_str(), twelve, 8, 12), 1);
+  EXPECT_EQ(c.pairs[6].name, n97 + "0");
+  EXPECT_EQ(c.pairs[16].name, n97 + "1");
+  EXPECT_EQ(c.pairs[17].name, n97 + "1");
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, std::string(120, 'm').c_str(), twelve, 8, 2), 1);
+  EXPECT_EQ(c.pairs.back().name, std::string(98, 'm'));
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, n97.c_str(), twelve, 8, 1), 1);
+  EXPECT_EQ(c.pairs.back().name, n97);
+
+  // Every name length, whole and split between prefix and name, comes out
+  // exactly (cut to 98).
+  for (size_t length = 0; length <= 110; ++length) {
+    std::string name;
+    for (size_t i = 0; i < length; ++i) name += static_cast<char>('!' + (i * 7 + length) % 90);
+    const std::string want = name.substr(0, 98);
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, "", name.c_str(), length), 1);
+    EXPECT_EQ(c.pairs.back().name, want) << length;
+    const std::string head = name.substr(0, length / 3), tail = name.substr(length / 3);
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, head.c_str(), tail.c_str(), length), 1);
+    EXPECT_EQ(c.pairs.back().name, want) << length;
+    ASSERT_EQ(AddMultipleFieldsToGenericContext(&c, name.c_str(), twelve, 8, 3), 1);
+    EXPECT_EQ(c.pairs.back().name, (name + "2").substr(0, 98)) << length;
+  }
+
   ReleaseGenericParserCxt(&c);
   ReleaseGenericParserCxt(&c);
   ReleaseGenericParserCxt(nullptr);
   EXPECT_TRUE(c.pairs.empty());
+
+  // Names stay readable as a context grows through many blocks, when it is
+  // moved (a copy would share its names, so there is none), and the
+  // released or moved-from context can be filled again.
+  static_assert(!std::is_copy_constructible_v<GenericParserCxt> && !std::is_copy_assignable_v<GenericParserCxt>);
+  static_assert(std::is_nothrow_move_constructible_v<GenericParserCxt>);
+  std::vector<std::string> expected;
+  for (int i = 0; i < 20000; ++i) {
+    expected.push_back("f" + std::string(static_cast<size_t>(i % 90), 'x') + std::to_string(i));
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, "", expected.back().c_str(), static_cast<uint64_t>(i)), 1);
+  }
+  GenericParserCxt moved = std::move(c);
+  ReleaseGenericParserCxt(&c);
+  EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "again", 1), 1);
+  EXPECT_EQ(Names(c), (std::vector<std::string>{"again"}));
+  c = std::move(moved);
+  EXPECT_EQ(Names(c), expected);
+  EXPECT_TRUE(moved.pairs.empty());
+  EXPECT_EQ(AddSingleValueToGenericContext(&moved, "", "later", 2), 1);
+  EXPECT_EQ(Names(moved), (std::vector<std::string>{"later"}));
+  VSPParseCxt stats;
+  EXPECT_EQ(AddSingleValueToGenericContext(&stats, "", "s", 3), 1);
+  VSPParseCxt stats_moved = std::move(stats);
+  VSPReleaseContext(&stats);
+  EXPECT_EQ(Names(stats_moved), (std::vector<std::string>{"s"}));
 }
 
 }  // namespace

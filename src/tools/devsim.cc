@@ -45,7 +45,7 @@ int Parse(const std::string& kind, const std::string& file) {
   else if (kind == "stats") result = VSPParseBufferToCxt(&stats, bytes.data(), size);
   else result = VSPMSPParseBufferToCxt(&generic, bytes.data(), size);
   for (const ParserPair& p : (kind == "stats" ? stats.pairs : generic.pairs))
-    std::printf("%s %s\n", p.name.c_str(), ParserPairValueText(p).c_str());
+    std::printf("%.*s %s\n", static_cast<int>(p.name.size()), p.name.data(), ParserPairValueText(p).c_str());
   std::printf("result %u\n", result);
   if (HasAPIErrorMessage()) std::printf("error: %s\n", GetAPIErrorMessage().c_str());
   return 0;
