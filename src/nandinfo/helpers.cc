@@ -78,7 +78,7 @@ cf::Dictionary CreateDictFromCxt(const GenericParserCxt& context, const cf::Valu
   out.Reserve(context.pairs.size());
   for (const ParserPair& pair : context.pairs) {
     if (filtered && !names.count(pair.name)) continue;
-    out.Set(pair.name, cf::Value::UInt64(pair.value));
+    out.Set(cf::Value(pair.name), cf::Value::UInt64(pair.value));  // the one copy of the name
   }
   return out;
 }

@@ -3,6 +3,7 @@
 // last-error message the parsers and the storage service report through.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <string>
 #include <string_view>
@@ -10,18 +11,60 @@
 
 #include "cf/format.h"
 
-// One pair. Names are at most 98 characters; names repeat when a key occurs
-// twice in a buffer.
+// The characters of a context's names, written one after another into
+// blocks that never move, so the views its pairs hold stay valid while it
+// grows. Move-only: a copy's views would point into the original's blocks.
+class ParserNameArena {
+ public:
+  ParserNameArena() = default;
+  ParserNameArena(ParserNameArena&& other) noexcept;
+  ParserNameArena& operator=(ParserNameArena&& other) noexcept;
+  ParserNameArena(const ParserNameArena&) = delete;
+  ParserNameArena& operator=(const ParserNameArena&) = delete;
+  ~ParserNameArena() { Release(); }
+
+  // At least n writable characters; throws std::bad_alloc. What is written
+  // there belongs to the arena only once committed.
+  char* Room(size_t n) { return left_ >= n ? cursor_ : NewBlock(n); }
+  void Commit(size_t n) {
+    cursor_ += n;
+    left_ -= n;
+  }
+  // Where the arena stands, and a return there that frees what came after.
+  struct Mark {
+    const void* block;
+    char* cursor;
+    size_t left;
+  };
+  Mark Position() const { return {head_, cursor_, left_}; }
+  void Rewind(const Mark& mark);
+  void Release();
+
+ private:
+  struct Block;
+  char* NewBlock(size_t n);
+
+  Block* head_ = nullptr;  // the block being filled; each links to the one before
+  char* cursor_ = nullptr;
+  size_t left_ = 0;
+  static constexpr size_t kFirstBlockSize = 4096;
+  size_t next_block_size_ = kFirstBlockSize;
+};
+
+// One pair. Names are at most 98 characters and live in the context's name
+// arena; names repeat when a key occurs twice in a buffer.
 struct ParserPair {
-  std::string name;
+  std::string_view name;
   uint64_t value;
 };
 
 // The value as the decimal text a context carries beside it ("%llu").
 std::string ParserPairValueText(const ParserPair& pair);
 
+// Move-only, as its name arena is.
 struct GenericParserCxt {
   std::vector<ParserPair> pairs;  // in the order added
+  ParserNameArena names;          // the characters of the pairs' names
 };
 
 // The full statistics context: the pairs plus well-known counters.
@@ -52,13 +95,18 @@ inline constexpr size_t kMaxParserNameLength = 98;
 // Appends (prefix + name, cut to 98 characters; value). 1 on success, 0 on
 // failure (a null context, or no memory).
 int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix, const char* name, uint64_t value);
+// The most elements one array add takes: its index counts in 16 bits.
+inline constexpr uint32_t kMaxParserArrayElements = 65536;
+
 // Appends count elements of elementSize bytes (each zero-extended to 64
 // bits): one pair under the bare name when count is 1, else name0, name1, ...
-// 1 when every element was added (and when there was nothing to add); 0 for
-// elements wider than 8 bytes or when an add failed.
+// 1 when every element was added (and when there was nothing to add). 0 for
+// elements wider than 8 bytes, more than kMaxParserArrayElements elements or
+// no memory; a call that fails adds nothing.
 int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* name, const void* source,
                                       uint32_t elementSize, uint32_t count);
-// Frees every pair and empties the context; harmless on an empty context.
+// Frees every pair and name and empties the context, which can be filled
+// again; harmless on an empty context.
 void ReleaseGenericParserCxt(GenericParserCxt* context);
 // Frees the pairs and zero-fills the whole context, fixed fields included.
 void VSPReleaseContext(VSPParseCxt* context);

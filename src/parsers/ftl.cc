@@ -1,7 +1,6 @@
 #include <algorithm>
 #include <bit>
 #include <cstring>
-#include <string>
 
 #include "parsers/ftl_table.h"
 #include "parsers/parsers.h"
@@ -50,7 +49,7 @@ uint32_t VSPFTLParseBufferToCxt(GenericParserCxt* context, const void* buffer, u
   const auto* words = static_cast<const uint8_t*>(buffer);
   uint64_t remaining = size / 8, at = 0;
   uint32_t count = 0;
-  std::string array_name;
+  char array_name[kMaxParserNameLength + 2];  // name_
   if (context) ReservePairs(*context, remaining);
   while (remaining > 0) {
     const uint64_t header = Word(words, at++);
@@ -70,8 +69,10 @@ uint32_t VSPFTLParseBufferToCxt(GenericParserCxt* context, const void* buffer, u
           SetAPIErrorMessage("VSPFTLParseBufferToCxt: %s(%u): (#%u) cfg elements != (%d) buffer elements", f->name,
                              f->key, f->count, static_cast<int32_t>(length));
         const uint32_t n = std::min(length, f->count);
-        array_name.assign(f->name).append("_");
-        if (!AddMultipleFieldsToGenericContext(context, array_name.c_str(), words + at * 8, 8, n)) {
+        const size_t name_length = std::min(std::strlen(f->name), kMaxParserNameLength);
+        std::memcpy(array_name, f->name, name_length);
+        std::memcpy(array_name + name_length, "_", 2);
+        if (!AddMultipleFieldsToGenericContext(context, array_name, words + at * 8, 8, n)) {
           SetAPIErrorMessage("VSPFTLParseBufferToCxt: %s(%u): Cannot add %u elements to context", f->name, f->key,
                              f->count);
           return count;

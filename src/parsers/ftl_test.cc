@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <type_traits>
+
 #include "parsers/parsers.h"
 #include "sim/statistics_buffers.h"
 
@@ -16,7 +18,7 @@ class FtlTest : public ::testing::Test {
   void TearDown() override { parsers::testing::g_adds_before_failure = -1; }
   static std::vector<std::string> Names(const GenericParserCxt& c) {
     std::vector<std::string> out;
-    for (const auto& p : c.pairs) out.push_back(p.name);
+    for (const auto& p : c.pairs) out.emplace_back(p.name);
     return out;
   }
   static uint32_t Ftl(GenericParserCxt& c, const WordRecordBuffer& b) {
@@ -27,23 +29,78 @@ class FtlTest : public ::testing::Test {
   }
 };
 
-TEST_F(FtlTest, CompleteBufferYieldsEveryValue) {
-  const std::string buffer = sim::CompleteFtlBuffer();
-  GenericParserCxt c;
-  EXPECT_EQ(VSPFTLParseBufferToCxt(&c, buffer.data(), static_cast<uint32_t>(buffer.size())), 2156u);
-  ASSERT_EQ(c.pairs.size(), 2156u);
-  EXPECT_EQ(c.pairs[0].name, "version");
-  EXPECT_EQ(c.pairs[0].value, 1000u);
-  EXPECT_EQ(GetAPIErrorMessage(), "NA");
-  VSPParseCxt s;
-  // The full statistics parse has no end marker: the marker's record is just
-  // skipped, and the buffer ends exactly after it.
-  EXPECT_EQ(VSPParseBufferToCxt(&s, buffer.data(), static_cast<uint32_t>(buffer.size())), 1u);
-  EXPECT_EQ(s.pairs.size(), 2156u);
-  EXPECT_EQ(s.driverVersion, 0xFFFFFFFFu);
-  VSPReleaseContext(&s);
-  EXPECT_TRUE(s.pairs.empty());
-  EXPECT_EQ(s.driverVersion, 0u);
+// Each fixed field of the full statistics context comes from its own key.
+// Keys and names are written out here rather than taken from the field
+// table, and each key gets a value of its own, so two swapped fields fail.
+TEST_F(FtlTest, StatsFixedFieldsByKey) {
+  struct Fixed {
+    uint32_t key;
+    const char* name;
+    uint64_t (*get)(const VSPParseCxt&);
+    bool low_32_bits;
+  };
+#define FIXED(key, field, narrow) {key, #field, [](const VSPParseCxt& c) -> uint64_t { return c.field; }, narrow}
+  const Fixed fixed[] = {
+      FIXED(4, hostWrites, false),
+      FIXED(7, hostReads, false),
+      FIXED(12, IND_pool_free, false),
+      FIXED(13, IND_pool_count, false),
+      FIXED(17, wearLevMoves, false),
+      FIXED(18, nandWrites, false),
+      FIXED(19, nandReads, false),
+      FIXED(20, bandErases, false),
+      FIXED(28, numSleepOps, false),
+      FIXED(45, maxHighEnduranceBlockErases, false),
+      FIXED(48, numFreeVirtualBlocks, false),
+      FIXED(49, bytesPerPage, true),
+      FIXED(50, pagesPerVirtualBlock, true),
+      FIXED(51, blocksPerVirtualBlock, true),
+      FIXED(52, numVirtualBlocks, true),
+      FIXED(53, exportVersion, true),
+      FIXED(56, utilFormatTime, false),
+  };
+#undef FIXED
+  ASSERT_EQ(std::size(fixed), 17u);
+  // Distinct in both halves, so the 32-bit fields differ too.
+  auto value = [](uint32_t key) { return (uint64_t{0xAB00 + key} << 32) | (0x5000 + key); };
+  auto expected = [&](const Fixed& f) { return f.low_32_bits ? value(f.key) & 0xFFFFFFFF : value(f.key); };
+
+  // One key at a time: its field and no other.
+  for (const Fixed& f : fixed) {
+    WordRecordBuffer b;
+    b.Record(f.key, {value(f.key)});
+    VSPParseCxt c;
+    ASSERT_EQ(Stats(c, b), 1u) << f.name;
+    for (const Fixed& g : fixed) EXPECT_EQ(g.get(c), &g == &f ? expected(f) : 0u) << f.name << " -> " << g.name;
+    for (uint64_t h : c.readCountHisto) EXPECT_EQ(h, 0u) << f.name;
+    ASSERT_EQ(c.pairs.size(), 1u);
+    EXPECT_EQ(c.pairs[0].name, f.name);
+    EXPECT_EQ(c.pairs[0].value, value(f.key));  // the pair keeps all 64 bits
+  }
+
+  // All together with readCountHisto (key 265, five elements; extra words
+  // are not stored), a key that has no fixed field, and the FTL end marker,
+  // which this parse does not know: the record after it is read.
+  WordRecordBuffer all;
+  for (const Fixed& f : fixed) all.Record(f.key, {value(f.key)});
+  all.Record(265, {71, 72, 73, 74, 75, 76, 77}).Record(16, {99}).End().Record(2, {98});
+  VSPParseCxt c;
+  ASSERT_EQ(Stats(c, all), 1u);
+  for (const Fixed& f : fixed) EXPECT_EQ(f.get(c), expected(f)) << f.name;
+  for (size_t i = 0; i < 5; ++i) EXPECT_EQ(c.readCountHisto[i], 71 + i) << i;
+  EXPECT_EQ(c.driverVersion, 0xFFFFFFFFu);
+  ASSERT_EQ(c.pairs.size(), 17u + 5u + 2u);
+  EXPECT_EQ(c.pairs[17].name, "readCountHisto0");
+  EXPECT_EQ(c.pairs[21].name, "readCountHisto4");
+  EXPECT_EQ(c.pairs[22].name, "gcWrites");
+  EXPECT_EQ(c.pairs[23].name, "hostWriteXacts");
+
+  // Release empties the pairs and zeroes every fixed field.
+  VSPReleaseContext(&c);
+  EXPECT_TRUE(c.pairs.empty());
+  for (const Fixed& f : fixed) EXPECT_EQ(f.get(c), 0u) << f.name;
+  for (uint64_t h : c.readCountHisto) EXPECT_EQ(h, 0u);
+  EXPECT_EQ(c.driverVersion, 0u);
 }
 
 TEST_F(FtlTest, EndRulesAndSkipping) {
@@ -159,11 +216,55 @@ TEST_F(FtlTest, AddFailures) {
   WordRecordBuffer arrays;
   arrays.Record(14, std::vector<uint64_t>(10, 1)).Record(2, {2});
   EXPECT_EQ(Ftl(c, arrays), 0u);
-  EXPECT_EQ(c.pairs.size(), 2u);  // what was added before the failure stays
+  EXPECT_TRUE(c.pairs.empty());  // no partial run of the failed array
   EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): Cannot add 10 elements to context");
   // The first message of the process wins.
   SetAPIErrorMessage("later %d", 1);
   EXPECT_EQ(GetAPIErrorMessage(), "VSPFTLParseBufferToCxt: hostWriteLogHisto(14): Cannot add 10 elements to context");
+}
+
+// An array add is all or nothing: a call that fails leaves the context as it
+// was before the call (earlier pairs stay), and a count the 16-bit index
+// cannot name is refused before anything is added.
+TEST_F(FtlTest, ArrayAddsAllOrNothing) {
+  std::vector<uint64_t> source(65537);
+  for (size_t i = 0; i < source.size(); ++i) source[i] = i * 3;
+  struct Case {
+    const char* what;
+    uint32_t count;
+    int64_t adds_before_failure;
+    int result;
+    size_t added;
+  };
+  const Case cases[] = {
+      {"the largest count", 65536, -1, 1, 65536},
+      {"one past the 16-bit index", 65537, -1, 0, 0},
+      {"heap exhausted mid-array", 10, 4, 0, 0},
+      {"heap exhausted at the first element", 10, 0, 0, 0},
+      {"heap exhausted at the last element", 10, 9, 0, 0},
+      {"heap holds exactly the array", 10, 10, 1, 10},
+      {"a single element without heap", 1, 0, 0, 0},
+      {"a count no heap could hold", UINT32_MAX, -1, 0, 0},
+  };
+  for (const Case& k : cases) {
+    GenericParserCxt c;
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, "", "before", 7), 1);
+    ASSERT_EQ(AddMultipleFieldsToGenericContext(&c, "pre", source.data(), 8, 3), 1);
+    parsers::testing::g_adds_before_failure = k.adds_before_failure;
+    EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "x", source.data(), 8, k.count), k.result) << k.what;
+    parsers::testing::g_adds_before_failure = -1;
+    EXPECT_EQ(c.pairs.size(), 4 + k.added) << k.what;
+    if (c.pairs.size() != 4 + k.added) continue;
+    EXPECT_EQ(c.pairs[3].name, "pre2") << k.what;
+    if (k.added > 0) {
+      EXPECT_EQ(c.pairs.back().name, "x" + std::to_string(k.added - 1)) << k.what;
+      EXPECT_EQ(c.pairs.back().value, (k.added - 1) * 3) << k.what;
+    }
+    // The context goes on from where it was.
+    EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "after", 1), 1);
+    EXPECT_EQ(c.pairs.back().name, "after");
+    EXPECT_EQ(c.pairs.size(), 5 + k.added) << k.what;
+  }
 }
 
 TEST_F(FtlTest, ContextOperations) {
@@ -184,10 +285,64 @@ TEST_F(FtlTest, ContextOperations) {
   EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 0, 3), 1);
   EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, "z", four, 9, 1), 0);
   EXPECT_EQ(c.pairs.size(), 6u);
+
+  // The 98-character cut applies after the index: "n...n10" and "n...n11"
+  // both become "n...n1"; one element keeps the bare name.
+  const std::string n97(97, 'n');
+  const uint64_t twelve[12] = {};
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, n97.c_str(), twelve, 8, 12), 1);
+  EXPECT_EQ(c.pairs[6].name, n97 + "0");
+  EXPECT_EQ(c.pairs[16].name, n97 + "1");
+  EXPECT_EQ(c.pairs[17].name, n97 + "1");
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, std::string(120, 'm').c_str(), twelve, 8, 2), 1);
+  EXPECT_EQ(c.pairs.back().name, std::string(98, 'm'));
+  EXPECT_EQ(AddMultipleFieldsToGenericContext(&c, n97.c_str(), twelve, 8, 1), 1);
+  EXPECT_EQ(c.pairs.back().name, n97);
+
+  // Every name length, whole and split between prefix and name, comes out
+  // exactly (cut to 98).
+  for (size_t length = 0; length <= 110; ++length) {
+    std::string name;
+    for (size_t i = 0; i < length; ++i) name += static_cast<char>('!' + (i * 7 + length) % 90);
+    const std::string want = name.substr(0, 98);
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, "", name.c_str(), length), 1);
+    EXPECT_EQ(c.pairs.back().name, want) << length;
+    const std::string head = name.substr(0, length / 3), tail = name.substr(length / 3);
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, head.c_str(), tail.c_str(), length), 1);
+    EXPECT_EQ(c.pairs.back().name, want) << length;
+    ASSERT_EQ(AddMultipleFieldsToGenericContext(&c, name.c_str(), twelve, 8, 3), 1);
+    EXPECT_EQ(c.pairs.back().name, (name + "2").substr(0, 98)) << length;
+  }
+
   ReleaseGenericParserCxt(&c);
   ReleaseGenericParserCxt(&c);
   ReleaseGenericParserCxt(nullptr);
   EXPECT_TRUE(c.pairs.empty());
+
+  // Names stay readable as a context grows through many blocks, when it is
+  // moved (a copy would share its names, so there is none), and the
+  // released or moved-from context can be filled again.
+  static_assert(!std::is_copy_constructible_v<GenericParserCxt> && !std::is_copy_assignable_v<GenericParserCxt>);
+  static_assert(std::is_nothrow_move_constructible_v<GenericParserCxt>);
+  std::vector<std::string> expected;
+  for (int i = 0; i < 20000; ++i) {
+    expected.push_back("f" + std::string(static_cast<size_t>(i % 90), 'x') + std::to_string(i));
+    ASSERT_EQ(AddSingleValueToGenericContext(&c, "", expected.back().c_str(), static_cast<uint64_t>(i)), 1);
+  }
+  GenericParserCxt moved = std::move(c);
+  ReleaseGenericParserCxt(&c);
+  EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "again", 1), 1);
+  EXPECT_EQ(Names(c), (std::vector<std::string>{"again"}));
+  c = std::move(moved);
+  EXPECT_EQ(Names(c), expected);
+  EXPECT_TRUE(moved.pairs.empty());
+  EXPECT_EQ(AddSingleValueToGenericContext(&moved, "", "later", 2), 1);
+  EXPECT_EQ(Names(moved), (std::vector<std::string>{"later"}));
+  VSPParseCxt stats;
+  EXPECT_EQ(AddSingleValueToGenericContext(&stats, "", "s", 3), 1);
+  VSPParseCxt stats_moved = std::move(stats);
+  VSPReleaseContext(&stats);
+  EXPECT_EQ(Names(stats_moved), (std::vector<std::string>{"s"}));
 }
 
 }  // namespace

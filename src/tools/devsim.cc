@@ -48,7 +48,7 @@ int Parse(const std::string& kind, const std::string& file) {
   else if (kind == "stats") result = VSPParseBufferToCxt(&stats, bytes.data(), size);
   else result = VSPMSPParseBufferToCxt(&generic, bytes.data(), size);
   for (const ParserPair& p : (kind == "stats" ? stats.pairs : generic.pairs))
-    std::printf("%s %s\n", p.name.c_str(), ParserPairValueText(p).c_str());
+    std::printf("%.*s %s\n", static_cast<int>(p.name.size()), p.name.data(), ParserPairValueText(p).c_str());
   std::printf("result %u\n", result);
   if (HasAPIErrorMessage()) std::printf("error: %s\n", GetAPIErrorMessage().c_str());
   return 0;
@@ -64,17 +64,31 @@ int Snapshot(const std::string& file, const std::string& header_file) {
     std::fwrite(out.data(), 1, result ? size : std::strlen(out.data()), stdout);
     return result ? 0 : 1;
   }
-  // Piece by piece, as a caller with a fixed buffer would; room enough for
-  // the preamble, so every call moves on.
+  // Piece by piece, as a caller with a fixed buffer would. The parser passes
+  // over a record that does not fit, so the next piece starts again at that
+  // record; when not even the first record of a piece (or the preamble)
+  // fits, that piece is thrown away and redone in a buffer twice as large.
+  constexpr size_t kLargestPiece = size_t{1} << 30;
   std::vector<char> out(std::max<size_t>(65536, header.size() + 4096));
   uint32_t index = 0;
   for (;;) {
+    const uint32_t start = index;
     uint32_t size = static_cast<uint32_t>(out.size());
     const int result = VSPParseSnapshotBufferWithInplaceParser(data.data(), static_cast<uint32_t>(data.size()),
                                                                out.data(), &size, header.data(),
                                                                static_cast<uint32_t>(header.size()), &index);
-    std::fwrite(out.data(), 1, size - 1, stdout);  // the text may hold a NUL of its own
+    if (result || index > uint64_t{start} + 1) std::fwrite(out.data(), 1, size - 1, stdout);  // the text may hold a NUL
     if (result) return 0;
+    if (index > uint64_t{start} + 1) {
+      index -= 1;  // the record that did not fit
+      continue;
+    }
+    index = start;
+    if (out.size() >= kLargestPiece) {
+      std::fprintf(stderr, "devsim: snapshot record %u does not fit in %zu bytes of text\n", start, out.size());
+      return 1;
+    }
+    out.resize(out.size() * 2);
   }
 }
 

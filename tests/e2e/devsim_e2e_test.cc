@@ -67,4 +67,52 @@ TEST_F(DevsimParseTest, SnapshotsInBothForms) {
   EXPECT_EQ(Devsim({"snapshot", fixed, "--header", dir / "nope"}).status, 2);
 }
 
+// A dump longer than devsim's 64 KiB pieces: every record is printed, the
+// ones that end a piece and, in the second snapshot, records whose text
+// alone is longer than a piece.
+TEST_F(DevsimParseTest, SnapshotLongerThanOnePiecePrintsEveryRecord) {
+  struct Case {
+    const char* what;
+    uint32_t triples;  // per-priority triples of each record, after its first word
+    uint32_t records;  // the last of them is never printed
+  };
+  const Case cases[] = {
+      {"8000 short records, about 118 KiB", 0, 8001},
+      {"3 records of about 80 KiB each", 4000, 4},
+  };
+  for (const Case& k : cases) {
+    sim::SnapshotBuilder b(6, 8 + 12 * k.triples);
+    b.Legend("A - alpha\nB - beta").Field(0, 0, 0, "A=%u").Field(0, 4, 0, " B=%u");
+    if (k.triples) b.Field(3, 8, 12 * k.triples, " %s=");
+    std::string expected = "- VSP Snapshot - \nA - alpha\nB - beta\n";
+    char text[64];
+    for (uint32_t i = 0; i < k.records; ++i) {
+      const uint32_t a = i + 1, bee = (i * 7919) % 100000;
+      b.Record({a, bee});
+      if (i + 1 == k.records) break;
+      std::snprintf(text, sizeof text, "A=%u B=%u", a, bee);
+      expected += text;
+      if (k.triples) {
+        const struct {
+          const char* letter;
+          const char* zero;
+        } parts[] = {{"O", "   0"}, {"L", "      0"}, {"M", "    0"}};
+        for (const auto& part : parts) {
+          expected += std::string(" ") + part.letter + "=" + part.zero;
+          for (uint32_t t = 1; t < k.triples; ++t) expected += std::string("/") + part.zero;
+        }
+      }
+      expected += "\n";
+    }
+    ASSERT_GT(expected.size(), 65536u) << k.what;
+    const RunResult r =
+        Devsim({"snapshot", Write("big.bin", b.Data()), "--header", Write("big_header.bin", b.Header())});
+    EXPECT_EQ(r.status, 0) << k.what;
+    EXPECT_EQ(r.out.size(), expected.size()) << k.what;
+    EXPECT_TRUE(r.out == expected) << k.what;  // not printed whole: it is long
+    const std::string last = "A=" + std::to_string(k.records - 1) + " ";
+    EXPECT_NE(r.out.rfind("\n" + last), std::string::npos) << k.what << ": the last record is missing";
+  }
+}
+
 }  // namespace
