@@ -106,5 +106,39 @@ int main(int argc, char** argv) {
   for (uint64_t id = 1; id <= 70; ++id) deep.Begin(id);
   deep.ThreadName("VM_swapout").IOStats(64);
   Seed("kcdata", "deep", deep.bytes());
+
+  // Registries: a controller under a parent, a parent loop, a bad entry; and
+  // the same files as a controller's answers.
+  auto service = [](const char* cls, uint64_t id, uint64_t parent, const char* client) {
+    cf::Dictionary d;
+    d.Set("class", cls);
+    d.Set("id", cf::Value::UInt64(id));
+    if (parent) d.Set("parent", cf::Value::UInt64(parent));
+    if (*client) d.Set("userClient", client);
+    cf::Dictionary characteristics;
+    characteristics.Set("chip-id", "K3R");
+    cf::Dictionary properties;
+    properties.Set("Controller Characteristics", characteristics);
+    d.Set("properties", properties);
+    return d;
+  };
+  auto xml = [](const cf::Value& v) {
+    std::string out;
+    cf::WriteXMLPropertyList(v, out, nullptr);
+    return out;
+  };
+  Seed("registry", "controller",
+       xml(cf::Array({service("Root", 1, 0, ""), service("VelmoraVNS3NVMeController", 2, 1, "nvme"),
+                      service("VSPStorage", 3, 2, "nvme")})));
+  Seed("registry", "parent-loop", xml(cf::Array({service("A", 1, 2, "nvme"), service("B", 2, 1, "")})));
+  Seed("registry", "bad-entry", xml(cf::Array({service("A", 1, 0, "nvme"), cf::Value("x")})));
+  cf::Dictionary stats;
+  stats.Set("hostWrites", cf::Value::UInt64(5));
+  stats.Set("hostWriteLogHisto", cf::Array({cf::Value::SInt32(1), cf::Value::SInt32(2)}));
+  cf::Dictionary controller;
+  controller.Set("stats", stats);
+  controller.Set("msp", cf::Array({stats}));
+  controller.Set("failCommands", cf::Array({cf::Value::SInt32(15)}));
+  Seed("registry", "controller-answers", xml(controller));
   return 0;
 }

@@ -31,8 +31,10 @@ void CollectNANDInfo() {
                merged.Get("com.velmora.NANDInfo.ErrorMessage"));
     return;
   }
-  for (const auto& [key, value] : merged)
-    if (key.AsString() && value.AsNumber()) TBClientSetValueForScalarKey(*key.AsString(), value.AsNumber()->AsSInt64());
+  TBClientWriteInOneTransaction([&] {
+    for (const auto& [key, value] : merged)
+      if (key.AsString() && value.AsNumber()) TBClientSetValueForScalarKey(*key.AsString(), value.AsNumber()->AsSInt64());
+  });
 }
 
 // Step 4: the kernel's pending ECC events. (A seam until the collection work

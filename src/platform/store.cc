@@ -288,6 +288,17 @@ bool TBClientPushValueForDistributionKey(std::string_view key, double value, int
                    [&](platform::TallyStore& s) { return s.PushSample(Today(), key, value, secondsInDayOffset); });
 }
 
+bool TBClientWriteInOneTransaction(const std::function<void()>& body) {
+  // Each write inside still reports its own failure; the batch commits
+  // whatever succeeded, as separate writes would have.
+  return WithStore("batch", [&](platform::TallyStore& s) {
+    return s.Batch([&] {
+      body();
+      return true;
+    });
+  });
+}
+
 bool TBClientCheckpoint() {
   return WithStore("checkpoint", [](platform::TallyStore& s) { return s.Checkpoint(); });
 }

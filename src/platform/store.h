@@ -71,6 +71,9 @@ int32_t TBDaysSince1970();
 bool TBClientSetValueForScalarKey(std::string_view key, int64_t value);
 bool TBClientAddValueForScalarKey(std::string_view key, int64_t value);
 bool TBClientPushValueForDistributionKey(std::string_view key, double value, int32_t secondsInDayOffset);
+// Runs body, whose client calls above then share one transaction: many keys
+// written at once cost one commit instead of one each.
+bool TBClientWriteInOneTransaction(const std::function<void()>& body);
 bool TBClientCheckpoint();
 // The start of a day in the store's time zone.
 cf::Date dateForDaysSince1970(int32_t day);

@@ -12,6 +12,7 @@
 #include "platform/faultkeep.h"
 #include "platform/files.h"
 #include "platform/store.h"
+#include "sim/default_device.h"
 
 namespace {
 
@@ -193,7 +194,7 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
   version.Set("ProductVersion", "4.2");
   version.Set("ProductBuildVersion", "22C41");
   if (!WritePlist(c.Path("/device/system-version.plist"), version, error)) return false;
-  const DefaultDevice device = StorageDevice();
+  const sim::DefaultDevice device = sim::DefaultStorageDevice();
   cf::Dictionary sysctl = SysctlProfile();
   sysctl.Set("kern.bootsessionuuid", device.boot_session_uuid);
   if (!WritePlist(c.Path("/device/sysctl.plist"), sysctl, error) ||

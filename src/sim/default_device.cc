@@ -1,12 +1,12 @@
-// The storage half of the default device: a registry with one controller of
-// the first kind, its answers (every FTL field, two MSP buffers), a
-// stackshot with the memory freezer's thread, and a purgeable-space answer.
+#include "sim/default_device.h"
+
 #include <map>
 #include <string>
 
 #include "parsers/ftl_table.h"
 #include "parsers/msp_table.h"
-#include "tools/default_root.h"
+
+namespace sim {
 
 namespace {
 
@@ -97,7 +97,7 @@ cf::Dictionary Entry(std::initializer_list<std::pair<const char*, cf::Value>> en
 
 }  // namespace
 
-DefaultDevice StorageDevice() {
+DefaultDevice DefaultStorageDevice() {
   DefaultDevice device;
   const cf::Dictionary characteristics = Entry({{"chip-id", "K3R"},
                                                 {"manufacturer-id", "45822603A5710"},
@@ -127,3 +127,5 @@ DefaultDevice StorageDevice() {
   device.boot_session_uuid = "7E3C1F0A-5B2D-4C8E-9A61-2F4D8B0C3E95";
   return device;
 }
+
+}  // namespace sim

@@ -1,0 +1,23 @@
+// The storage half of the default device, as devsim init writes it and the
+// tests and benchmarks use it: a registry with one controller of the first
+// kind and its answers (every FTL field, two MSP buffers), a stackshot with
+// the memory freezer's thread, a purgeable-space answer and the boot
+// session's id.
+#pragma once
+
+#include <string>
+
+#include "cf/value.h"
+
+namespace sim {
+
+struct DefaultDevice {
+  cf::Value registry;    // device/registry.plist
+  cf::Value controller;  // device/controller.plist
+  cf::Value stackshot;   // device/stackshot.plist
+  cf::Value purgeable;   // device/purgeable.plist
+  std::string boot_session_uuid;  // "kern.bootsessionuuid" of device/sysctl.plist
+};
+DefaultDevice DefaultStorageDevice();
+
+}  // namespace sim
