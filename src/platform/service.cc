@@ -34,7 +34,7 @@ class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
   bool resumed_ = false;
   std::string path_;  // the socket file of a listener, removed on close
   xpc_handler_t handler_;
-  std::string buffer_;
+  ServiceFrameReader reader_;
 };
 
 namespace {
@@ -65,6 +65,54 @@ uint32_t BigEndian32(const char* p) {
 
 }  // namespace
 
+namespace testing {
+size_t ServiceBufferedBytes() {
+  size_t n = 0;
+  for (const auto& c : Watched()) n += c->reader_.capacity();
+  return n;
+}
+}  // namespace testing
+
+void ServiceFrameReader::Append(std::string_view bytes) {
+  // Drop what was handed out before growing, so the buffer holds at most the
+  // unfinished frame and this chunk.
+  if (start_ > 0) {
+    buffer_.erase(0, start_);
+    start_ = 0;
+  }
+  buffer_.append(bytes);
+}
+
+ServiceFrameReader::Result ServiceFrameReader::Next(cf::Value* message, std::string* error) {
+  const size_t waiting = buffer_.size() - start_;
+  if (waiting >= 4) {
+    const uint32_t length = BigEndian32(buffer_.data() + start_);
+    if (length > kMaxServiceFrame) {
+      if (error) *error = cf::Format("Service message of %u bytes is over the limit of %u", length,
+                                     static_cast<uint32_t>(kMaxServiceFrame));
+      return Result::kBad;
+    }
+    if (waiting - 4 >= length) {
+      std::string reason;
+      *message = DecodeServiceMessage(std::string_view(buffer_).substr(start_ + 4, length), &reason);
+      start_ += 4 + size_t{length};
+      if (message->IsNull()) {
+        if (error) *error = "Bad service message (" + reason + ")";
+        return Result::kBad;
+      }
+      return Result::kMessage;
+    }
+  }
+  // Waiting for more: keep only the unfinished bytes, and give back the room
+  // a large frame left behind, so an idle peer holds next to nothing.
+  if (start_ > 0) {
+    buffer_.erase(0, start_);
+    start_ = 0;
+  }
+  if (buffer_.capacity() > 4096 && buffer_.capacity() > 2 * buffer_.size()) buffer_.shrink_to_fit();
+  return Result::kNeedMore;
+}
+
 void XPCConnection::Close() {
   if (fd_ < 0) return;
   close(fd_);
@@ -86,30 +134,22 @@ bool XPCConnection::OnReady() {
     if (errno == EINTR || errno == EAGAIN) return false;
   }
   if (n <= 0) {
-    if (!buffer_.empty()) LogError("Service peer closed the connection in the middle of a message");
+    if (reader_.mid_frame()) LogError("Service peer closed the connection in the middle of a message");
     Close();
     Unwatch(this);
     Deliver(handler_, {XPCEvent::Type::kError, nullptr, {}});
     return true;
   }
-  buffer_.append(chunk, static_cast<size_t>(n));
+  reader_.Append(std::string_view(chunk, static_cast<size_t>(n)));
   bool delivered = false;
   // Hand over every complete frame; a bad one ends this connection.
-  while (fd_ >= 0 && buffer_.size() >= 4) {
-    const uint32_t length = BigEndian32(buffer_.data());
-    if (length > kMaxServiceFrame) {
-      LogError("Service message of %u bytes is over the limit of %u; closing the connection", length,
-               static_cast<uint32_t>(kMaxServiceFrame));
-      Close();
-      Unwatch(this);
-      return delivered;
-    }
-    if (buffer_.size() < 4 + size_t{length}) break;
+  while (fd_ >= 0) {
+    cf::Value message;
     std::string error;
-    cf::Value message = DecodeServiceMessage(std::string_view(buffer_).substr(4, length), &error);
-    buffer_.erase(0, 4 + size_t{length});
-    if (message.IsNull()) {
-      LogError("Bad service message (%s); closing the connection", error);
+    const ServiceFrameReader::Result result = reader_.Next(&message, &error);
+    if (result == ServiceFrameReader::Result::kNeedMore) break;
+    if (result == ServiceFrameReader::Result::kBad) {
+      LogError("%s; closing the connection", error);
       Close();
       Unwatch(this);
       return delivered;

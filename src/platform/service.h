@@ -48,6 +48,30 @@ bool EncodeServiceFrame(const cf::Value& message, std::string* frame, std::strin
 // Parses a frame body; a result that is not a dictionary gives an error.
 cf::Value DecodeServiceMessage(std::string_view body, std::string* error);
 
+// Cuts a connection's byte stream into messages. It holds only the bytes
+// that arrived and are not yet handed out, whatever length a frame announces.
+class ServiceFrameReader {
+ public:
+  enum class Result { kNeedMore, kMessage, kBad };
+  void Append(std::string_view bytes);
+  // The next complete message; kNeedMore until one is complete; kBad (the
+  // reason in *error) for a frame over kMaxServiceFrame or a body that is no
+  // dictionary, after which the stream cannot be trusted.
+  Result Next(cf::Value* message, std::string* error);
+  // Bytes of an unfinished frame are waiting.
+  bool mid_frame() const { return buffer_.size() > start_; }
+  size_t capacity() const { return buffer_.capacity(); }
+
+ private:
+  std::string buffer_;
+  size_t start_ = 0;  // bytes at the front already handed out
+};
+
+namespace testing {
+// The bytes the connections' frame readers hold.
+size_t ServiceBufferedBytes();
+}  // namespace testing
+
 }  // namespace platform
 
 // Null when the socket cannot be created (the reason goes to the log).

@@ -1,11 +1,13 @@
 #include "platform/service.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <thread>
@@ -103,6 +105,92 @@ TEST(ServiceTest, MessagesReachTheHandlerAndBadFramesOnlyEndTheirConnection) {
   std::string error;
   EXPECT_FALSE(SendServiceMessage(kName, message, &error));
   EXPECT_NE(error.find("no service listening at " + path), std::string::npos) << error;
+}
+
+// A client socket connected to path (it waits in the backlog until accepted).
+int Connect(const std::string& path) {
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strcpy(addr.sun_path, path.c_str());
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd >= 0 && connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// A listener that keeps and resumes every peer, counting their messages.
+struct Server {
+  xpc_connection_t listener = xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER);
+  std::vector<xpc_connection_t> peers;
+  size_t messages = 0;
+
+  Server() {
+    if (!listener) return;
+    xpc_connection_set_event_handler(listener, [this](const XPCEvent& e) {
+      peers.push_back(e.connection);
+      xpc_connection_set_event_handler(e.connection, [this](const XPCEvent& m) {
+        if (m.type == XPCEvent::Type::kDictionary) ++messages;
+      });
+      xpc_connection_resume(e.connection);
+    });
+    xpc_connection_resume(listener);
+  }
+  ~Server() {
+    for (auto& p : peers) xpc_connection_cancel(p);
+    xpc_connection_cancel(listener);
+  }
+  // Runs the loop until it has nothing more to do for a moment.
+  void Drain() {
+    while (CFRunLoopRunInMode(0.2, true) != kCFRunLoopRunTimedOut) {
+    }
+  }
+  void RunUntilMessages(size_t n) {
+    for (int i = 0; i < 40 && messages < n; ++i) CFRunLoopRunInMode(0.5, true);
+  }
+  void RunUntilPeers(size_t n) {
+    for (int i = 0; i < 40 && peers.size() < n; ++i) CFRunLoopRunInMode(0.5, true);
+  }
+};
+
+TEST(ServiceTest, AFrameHoldsOnlyTheBytesThatArrived) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  Server server;
+  ASSERT_NE(server.listener, nullptr);
+  const std::string path = ServiceSocketPath(kName);
+
+  // Frames that announce 1 MiB but send ten bytes.
+  std::vector<int> clients;
+  for (int i = 0; i < 20; ++i) {
+    clients.push_back(Connect(path));
+    ASSERT_GE(clients.back(), 0);
+    const std::string partial = Frame(kMaxServiceFrame, std::string(10, 'x'));
+    ASSERT_EQ(write(clients.back(), partial.data(), partial.size()), static_cast<ssize_t>(partial.size()));
+    server.RunUntilPeers(clients.size());
+  }
+  server.Drain();
+  EXPECT_LE(testing::ServiceBufferedBytes(), 20u * 4096);
+  for (int fd : clients) close(fd);
+  server.Drain();
+  EXPECT_EQ(log->Count("Service peer closed the connection in the middle of a message"), 20u);
+
+  // A large message delivered leaves no large buffer behind on an idle peer.
+  cf::Dictionary big;
+  big.Set("padding", cf::Value::Bytes(cf::Data(kMaxServiceFrame - 1024, 1)));
+  std::string frame;
+  ASSERT_TRUE(EncodeServiceFrame(big, &frame, nullptr));
+  const int client = Connect(path);
+  ASSERT_GE(client, 0);
+  std::thread writer([&] { (void)!write(client, frame.data(), frame.size()); });
+  server.RunUntilMessages(1);
+  writer.join();
+  server.Drain();
+  EXPECT_LE(testing::ServiceBufferedBytes(), 4096u);
+  close(client);
+  server.Drain();
 }
 
 TEST(ServiceTest, AFileWhereTheSocketDirectoryBelongsIsReportedAsSuch) {
