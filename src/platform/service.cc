@@ -33,6 +33,8 @@ class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
   bool listener_;
   bool resumed_ = false;
   std::string path_;  // the socket file of a listener, removed on close
+  dev_t socket_device_ = 0;  // which file at path_ is ours
+  ino_t socket_inode_ = 0;
   xpc_handler_t handler_;
   ServiceFrameReader reader_;
 };
@@ -117,7 +119,12 @@ void XPCConnection::Close() {
   if (fd_ < 0) return;
   close(fd_);
   fd_ = -1;
-  if (listener_ && !path_.empty()) unlink(path_.c_str());
+  // Remove the socket only while it is still ours: another instance may
+  // have replaced it meanwhile.
+  struct stat st;
+  if (listener_ && !path_.empty() && lstat(path_.c_str(), &st) == 0 && st.st_dev == socket_device_ &&
+      st.st_ino == socket_inode_)
+    unlink(path_.c_str());
 }
 
 bool XPCConnection::OnReady() {
@@ -226,6 +233,50 @@ bool SendServiceMessage(std::string_view service_name, const cf::Value& message,
 
 using namespace platform;
 
+namespace {
+
+// Makes way for the listener: true when nothing is at path or only a socket
+// that nobody answers (left by a run that died), which is removed. A live
+// socket belongs to another instance, and anything else is not ours to
+// delete; both are reported and left alone.
+bool ClearSocketPath(const std::string& path, const sockaddr_un& addr) {
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0) {
+    if (errno == ENOENT) return true;
+    LogError("Cannot inspect %s: %s", path, std::strerror(errno));
+    return false;
+  }
+  if (!S_ISSOCK(st.st_mode)) {
+    LogError("%s is not a socket; leaving it alone and not serving", path);
+    return false;
+  }
+  const int probe = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  if (probe < 0) {
+    LogError("Cannot create the service socket: %s", std::strerror(errno));
+    return false;
+  }
+  const int connected = connect(probe, reinterpret_cast<const sockaddr*>(&addr), sizeof addr);
+  const int connect_error = errno;
+  close(probe);
+  // A full backlog (EAGAIN) is a live listener too.
+  if (connected == 0 || connect_error == EAGAIN || connect_error == EINPROGRESS) {
+    LogError("Another instance serves %s; not taking it over", path);
+    return false;
+  }
+  if (connect_error != ECONNREFUSED) {
+    LogError("Cannot tell whether %s is in use (%s); leaving it alone", path, std::strerror(connect_error));
+    return false;
+  }
+  if (unlink(path.c_str()) != 0 && errno != ENOENT) {
+    LogError("Cannot remove the stale socket %s: %s", path, std::strerror(errno));
+    return false;
+  }
+  LogInfo("Removed the stale socket %s", path);
+  return true;
+}
+
+}  // namespace
+
 xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint64_t flags) {
   if (!(flags & XPC_CONNECTION_MACH_SERVICE_LISTENER)) {
     LogError("Only listeners can be created for %s", std::string(name));
@@ -244,22 +295,26 @@ xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint6
     LogError("Cannot create the directory of %s: %s", path, std::strerror(errno));
     return nullptr;
   }
+  if (!ClearSocketPath(path, addr)) return nullptr;
   const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
   if (fd < 0) {
     LogError("Cannot create the service socket: %s", std::strerror(errno));
     return nullptr;
   }
-  unlink(path.c_str());  // a socket left by an earlier run
   // Bind under a strict umask so the socket is 0600 from its first moment.
   const mode_t old_mask = umask(0177);
   const int bound = bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
   umask(old_mask);
-  if (bound != 0 || listen(fd, 16) != 0) {
+  struct stat st;
+  if (bound != 0 || listen(fd, 16) != 0 || lstat(path.c_str(), &st) != 0) {
     LogError("Cannot listen on %s: %s", path, std::strerror(errno));
     close(fd);
     return nullptr;
   }
-  return std::make_shared<XPCConnection>(fd, true, path);
+  auto listener = std::make_shared<XPCConnection>(fd, true, path);
+  listener->socket_device_ = st.st_dev;
+  listener->socket_inode_ = st.st_ino;
+  return listener;
 }
 
 void xpc_connection_set_event_handler(const xpc_connection_t& connection, xpc_handler_t handler) {

@@ -44,7 +44,6 @@ TEST(ServiceTest, MessagesReachTheHandlerAndBadFramesOnlyEndTheirConnection) {
   auto log = std::make_shared<CaptureLog>();
   ContextScope scope(root.path(), Backends{nullptr, log});
   const std::string path = ServiceSocketPath(kName);
-  ASSERT_TRUE(WriteFileAtomically(path, "stale"));  // an old socket file is replaced
 
   std::vector<cf::Value> messages;
   int errors = 0;
@@ -153,6 +152,72 @@ struct Server {
     for (int i = 0; i < 40 && peers.size() < n; ++i) CFRunLoopRunInMode(0.5, true);
   }
 };
+
+std::string GoodFrame() {
+  cf::Dictionary message;
+  message.Set("operation", cf::Value::SInt64(2));
+  std::string frame;
+  EncodeServiceFrame(message, &frame, nullptr);
+  return frame;
+}
+
+TEST(ServiceTest, TheSocketPathIsTakenOnlyFromADeadListener) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  const std::string path = ServiceSocketPath(kName);
+
+  // Not a socket: reported, left alone, not served.
+  ASSERT_TRUE(WriteFileAtomically(path, "keep me"));
+  EXPECT_EQ(xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER), nullptr);
+  EXPECT_EQ(log->Count(path + " is not a socket; leaving it alone and not serving"), 1u);
+  EXPECT_EQ(ReadFile(path), "keep me");
+  ASSERT_EQ(unlink(path.c_str()), 0);
+
+  // A socket nobody answers (its process died) is replaced.
+  {
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::strcpy(addr.sun_path, path.c_str());
+    const int dead = socket(AF_UNIX, SOCK_STREAM, 0);
+    ASSERT_EQ(bind(dead, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    close(dead);
+  }
+  {
+    Server first;
+    ASSERT_NE(first.listener, nullptr);
+    EXPECT_EQ(log->Count("Removed the stale socket " + path), 1u);
+
+    // A live one belongs to another instance: never unlinked or taken over.
+    struct stat before, after;
+    ASSERT_EQ(stat(path.c_str(), &before), 0);
+    EXPECT_EQ(xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER), nullptr);
+    EXPECT_EQ(log->Count("Another instance serves " + path + "; not taking it over"), 1u);
+    ASSERT_EQ(stat(path.c_str(), &after), 0);
+    EXPECT_EQ(after.st_ino, before.st_ino);
+    const int client = Connect(path);
+    ASSERT_GE(client, 0);
+    const std::string frame = GoodFrame();
+    ASSERT_EQ(write(client, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+    close(client);
+    first.Drain();
+    EXPECT_EQ(first.messages, 1u);  // the first instance still serves
+  }
+  EXPECT_FALSE(FileExists(path));  // and removes its socket at the end
+
+  // A listener removes the socket at its path only while it is its own.
+  Server replaced;
+  ASSERT_NE(replaced.listener, nullptr);
+  ASSERT_EQ(unlink(path.c_str()), 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strcpy(addr.sun_path, path.c_str());
+  const int other = socket(AF_UNIX, SOCK_STREAM, 0);
+  ASSERT_EQ(bind(other, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  xpc_connection_cancel(replaced.listener);
+  EXPECT_TRUE(FileExists(path));
+  close(other);
+}
 
 TEST(ServiceTest, AFrameHoldsOnlyTheBytesThatArrived) {
   TempDir root;
