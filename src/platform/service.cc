@@ -8,6 +8,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <thread>
@@ -22,7 +23,7 @@ namespace platform {
 
 class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
  public:
-  XPCConnection(int fd, bool listener, std::string path) : fd_(fd), listener_(listener), path_(std::move(path)) {}
+  XPCConnection(int fd, bool listener, std::string path);
   ~XPCConnection() { Close(); }
 
   void Close();
@@ -37,9 +38,18 @@ class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
   ino_t socket_inode_ = 0;
   xpc_handler_t handler_;
   ServiceFrameReader reader_;
+  // A listener whose accept failed (out of descriptors) is not polled until
+  // this time: its pending peer would make poll return at once, forever.
+  std::chrono::steady_clock::time_point paused_until_{};
+  bool accept_failing_ = false;
 };
 
 namespace {
+
+constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
+
+size_t g_open_peers = 0;
+uint64_t g_poll_calls = 0;
 
 // Connections the run loop watches, in the order they were resumed.
 std::vector<xpc_connection_t>& Watched() {
@@ -68,6 +78,7 @@ uint32_t BigEndian32(const char* p) {
 }  // namespace
 
 namespace testing {
+uint64_t ServicePollCalls() { return g_poll_calls; }
 size_t ServiceBufferedBytes() {
   size_t n = 0;
   for (const auto& c : Watched()) n += c->reader_.capacity();
@@ -115,10 +126,16 @@ ServiceFrameReader::Result ServiceFrameReader::Next(cf::Value* message, std::str
   return Result::kNeedMore;
 }
 
+XPCConnection::XPCConnection(int fd, bool listener, std::string path)
+    : fd_(fd), listener_(listener), path_(std::move(path)) {
+  if (!listener_ && fd_ >= 0) ++g_open_peers;
+}
+
 void XPCConnection::Close() {
   if (fd_ < 0) return;
   close(fd_);
   fd_ = -1;
+  if (!listener_) --g_open_peers;
   // Remove the socket only while it is still ours: another instance may
   // have replaced it meanwhile.
   struct stat st;
@@ -131,7 +148,15 @@ bool XPCConnection::OnReady() {
   auto self = shared_from_this();  // a handler may cancel us
   if (listener_) {
     const int peer = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
-    if (peer < 0) return false;
+    if (peer < 0) {
+      if (errno == EINTR || errno == EAGAIN || errno == ECONNABORTED) return false;
+      if (!accept_failing_)
+        LogError("Cannot accept a service connection (%s); pausing the listener", std::strerror(errno));
+      accept_failing_ = true;
+      paused_until_ = std::chrono::steady_clock::now() + kAcceptBackoff;
+      return false;
+    }
+    accept_failing_ = false;
     Deliver(handler_, {XPCEvent::Type::kConnection, std::make_shared<XPCConnection>(peer, false, ""), {}});
     return true;
   }
@@ -341,7 +366,6 @@ int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled) {
   for (;;) {
     const auto now = Clock::now();
     if (now >= deadline) return kCFRunLoopRunTimedOut;
-    const int wait_ms = static_cast<int>(std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now).count()) + 1;
     std::vector<xpc_connection_t> sources = Watched();
     if (sources.empty()) {
       // The main queue is always a source of the main run loop, so an empty
@@ -349,13 +373,29 @@ int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled) {
       std::this_thread::sleep_for(deadline - now);
       return kCFRunLoopRunTimedOut;
     }
+    // A listener at the connection cap, or paused after a failed accept, is
+    // left out (fd -1) so that its pending peers do not wake the loop.
+    auto wake = deadline;
     std::vector<pollfd> fds;
-    for (const auto& c : sources) fds.push_back({c->fd_, POLLIN, 0});
+    for (const auto& c : sources) {
+      int fd = c->fd_;
+      if (c->listener_) {
+        if (g_open_peers >= kMaxServiceConnections) {
+          fd = -1;
+        } else if (c->paused_until_ > now) {
+          fd = -1;
+          wake = std::min(wake, c->paused_until_);
+        }
+      }
+      fds.push_back({fd, POLLIN, 0});
+    }
+    const int wait_ms = static_cast<int>(std::chrono::duration_cast<std::chrono::milliseconds>(wake - now).count()) + 1;
+    ++g_poll_calls;
     const int ready = poll(fds.data(), fds.size(), wait_ms);
     if (ready < 0 && errno != EINTR) return kCFRunLoopRunStopped;
     bool handled = false;
     for (size_t i = 0; ready > 0 && i < fds.size(); ++i)
-      if (fds[i].revents && sources[i]->fd_ >= 0) handled |= sources[i]->OnReady();
+      if (fds[i].fd >= 0 && fds[i].revents && sources[i]->fd_ >= 0) handled |= sources[i]->OnReady();
     if (handled && returnAfterSourceHandled) return kCFRunLoopRunHandledSource;
   }
 }

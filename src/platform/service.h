@@ -30,6 +30,10 @@ using xpc_handler_t = std::function<void(const XPCEvent&)>;
 
 inline constexpr uint64_t XPC_CONNECTION_MACH_SERVICE_LISTENER = 1;
 inline constexpr size_t kMaxServiceFrame = 1 << 20;
+// Peers served at once. Beyond this the listener is not polled, so further
+// peers wait in the kernel's backlog (their messages are not lost) until
+// one of these closes.
+inline constexpr size_t kMaxServiceConnections = 64;
 
 // Run-loop results.
 inline constexpr int32_t kCFRunLoopRunFinished = 1;
@@ -68,6 +72,8 @@ class ServiceFrameReader {
 };
 
 namespace testing {
+// How often the run loop has called poll, to see that it does not spin.
+uint64_t ServicePollCalls();
 // The bytes the connections' frame readers hold.
 size_t ServiceBufferedBytes();
 }  // namespace testing

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -217,6 +218,69 @@ TEST(ServiceTest, TheSocketPathIsTakenOnlyFromADeadListener) {
   xpc_connection_cancel(replaced.listener);
   EXPECT_TRUE(FileExists(path));
   close(other);
+}
+
+TEST(ServiceTest, ConnectionsBeyondTheCapWaitInTheBacklog) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  Server server;
+  ASSERT_NE(server.listener, nullptr);
+  const std::string frame = GoodFrame();
+  std::vector<int> clients;
+  for (size_t i = 0; i < kMaxServiceConnections + 2; ++i) {
+    const int fd = Connect(ServiceSocketPath(kName));
+    ASSERT_GE(fd, 0);
+    ASSERT_EQ(write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+    clients.push_back(fd);
+    server.RunUntilMessages(std::min(i + 1, kMaxServiceConnections));
+  }
+  server.Drain();
+  EXPECT_EQ(server.peers.size(), kMaxServiceConnections);
+  EXPECT_EQ(server.messages, kMaxServiceConnections);
+  // A peer that goes makes room for one that waited; its message was kept.
+  close(clients[0]);
+  server.Drain();
+  EXPECT_EQ(server.peers.size(), kMaxServiceConnections + 1);
+  EXPECT_EQ(server.messages, kMaxServiceConnections + 1);
+  for (size_t i = 1; i < clients.size(); ++i) close(clients[i]);
+  server.Drain();
+  EXPECT_EQ(server.peers.size(), kMaxServiceConnections + 2);
+  EXPECT_EQ(server.messages, kMaxServiceConnections + 2);
+}
+
+TEST(ServiceTest, OutOfDescriptorsTheListenerPausesInsteadOfSpinning) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  Server server;
+  ASSERT_NE(server.listener, nullptr);
+  const int client = Connect(ServiceSocketPath(kName));
+  ASSERT_GE(client, 0);
+  const std::string frame = GoodFrame();
+  ASSERT_EQ(write(client, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+
+  // Use up every descriptor, so accept fails with EMFILE.
+  rlimit saved;
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
+  rlimit low = saved;
+  low.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 256);
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
+  std::vector<int> filler;
+  for (int fd; (fd = dup(client)) >= 0;) filler.push_back(fd);
+  const uint64_t polls = testing::ServicePollCalls();
+  EXPECT_EQ(CFRunLoopRunInMode(0.5, true), kCFRunLoopRunTimedOut);
+  const uint64_t spent = testing::ServicePollCalls() - polls;
+  for (int fd : filler) close(fd);
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
+  // A spinning loop polls hundreds of thousands of times in half a second;
+  // pausing 100 ms after each failure polls about twice per pause.
+  EXPECT_LE(spent, 30u) << spent;
+  EXPECT_EQ(log->Count("Cannot accept a service connection (Too many open files); pausing the listener"), 1u);
+
+  close(client);
+  server.Drain();
+  EXPECT_EQ(server.messages, 1u);  // served once descriptors are free again
 }
 
 TEST(ServiceTest, AFrameHoldsOnlyTheBytesThatArrived) {
