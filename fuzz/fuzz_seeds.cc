@@ -20,6 +20,12 @@ void Seed(const std::string& target, const std::string& name, const std::string&
 
 std::string U16(uint16_t v) { return std::string{static_cast<char>(v >> 8), static_cast<char>(v)}; }
 
+std::string BigEndian(uint64_t v, int bytes) {
+  std::string out;
+  for (int i = bytes - 1; i >= 0; --i) out += static_cast<char>(v >> (8 * i));
+  return out;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -140,5 +146,35 @@ int main(int argc, char** argv) {
   controller.Set("msp", cf::Array({stats}));
   controller.Set("failCommands", cf::Array({cf::Value::SInt32(15)}));
   Seed("registry", "controller-answers", xml(controller));
+
+  // Frame streams: a read-size byte, then what a peer sends.
+  std::string frame, small;
+  platform::EncodeServiceFrame(message, &frame, nullptr);
+  cf::Dictionary run_day;
+  run_day.Set("operation", cf::Value::SInt64(1));
+  run_day.Set("value", cf::Value::SInt64(20778));
+  platform::EncodeServiceFrame(run_day, &small, nullptr);
+  auto length = [](uint32_t n) { return BigEndian(n, 4); };
+  std::string array;
+  cf::WriteBinaryPropertyList(cf::Array({cf::Value("x")}), array, nullptr);
+  Seed("service_frames", "one", "\xff" + frame);
+  Seed("service_frames", "two-byte-by-byte", std::string(1, '\0') + frame + small);
+  Seed("service_frames", "then-over-limit", "\x07" + small + length(platform::kMaxServiceFrame + 1) + "xx");
+  Seed("service_frames", "not-a-dictionary", "\x03" + length(static_cast<uint32_t>(array.size())) + array);
+  Seed("service_frames", "junk-body", "\x10" + length(5) + "junk!" + small);
+  Seed("service_frames", "truncated", "\x05" + frame.substr(0, frame.size() - 3));
+  Seed("service_frames", "empty-body", "\x01" + length(0) + small);
+  Seed("service_frames", "partial-header", "\x02" + small + small.substr(0, 2));
+  Seed("service_frames", "announces-1MiB", "\x20" + length(platform::kMaxServiceFrame) + "bplist00");
+  // One 200-byte string in each of 1000 array slots: small to send, large to decode.
+  std::string shared = "bplist00";
+  shared += "\xAF\x11" + BigEndian(1000, 2) + std::string(1000, '\x01');
+  const size_t leaf = shared.size();
+  shared += "\x5F\x10\xC8" + std::string(200, 's');
+  const size_t table = shared.size();
+  shared += BigEndian(8, 2) + BigEndian(leaf, 2);
+  shared += std::string(6, '\0') + "\x02\x01" + BigEndian(2, 8) + BigEndian(0, 8) + BigEndian(table, 8);
+  Seed("service_frames", "shared-string", "\xff" + length(static_cast<uint32_t>(shared.size())) + shared);
+  Seed("plist", "shared-string.bplist", shared);
   return 0;
 }

@@ -1,6 +1,7 @@
 // Reader of binary property lists ("bplist00"). Written here rather than
 // taken from libplist because that reader aborts the process (assertions)
 // on some hostile inputs, and binary lists arrive over the service socket.
+#include <algorithm>
 #include <cstring>
 
 #include "cf/plist.h"
@@ -9,13 +10,21 @@ namespace cf {
 namespace {
 
 constexpr double kPlistEpoch = 978307200.0;  // 2001-01-01 in Unix seconds
-// Shared objects can make a small file describe a huge tree; this many
-// decoded objects is far beyond any list the system exchanges.
-constexpr uint64_t kMaxDecodedObjects = 1'000'000;
+// Shared objects let a small list describe a huge tree (one long string
+// referenced from every slot of an array), so the decoded tree is bounded in
+// bytes: each object costs a fixed amount (its value and its slot in the
+// parent) plus its string or data bytes, and the total may be at most
+// kDecodedBytesPerInputByte times the input and never over kMaxDecodedBytes.
+constexpr uint64_t kDecodedObjectCost = 32;
+constexpr uint64_t kDecodedBytesPerInputByte = 32;
+constexpr uint64_t kMaxDecodedBytes = uint64_t{64} << 20;
 
 class Reader {
  public:
-  explicit Reader(std::string_view bytes) : b_(reinterpret_cast<const uint8_t*>(bytes.data())), n_(bytes.size()) {}
+  explicit Reader(std::string_view bytes)
+      : b_(reinterpret_cast<const uint8_t*>(bytes.data())),
+        n_(bytes.size()),
+        budget_(std::min<uint64_t>(kMaxDecodedBytes, n_ * kDecodedBytesPerInputByte)) {}
 
   bool Parse(Value& out, std::string& error) {
     if (n_ < 8 + 32 || std::memcmp(b_, "bplist00", 8) != 0) return Fail("malformed binary property list", error);
@@ -45,6 +54,13 @@ class Reader {
     return v;
   }
 
+  // Charges decoded bytes against the budget before they are allocated.
+  bool Spend(uint64_t bytes, std::string& error) {
+    if (bytes > budget_) return Fail("binary property list too large when decoded", error);
+    budget_ -= bytes;
+    return true;
+  }
+
   bool Have(uint64_t at, uint64_t size) const { return at <= table_ && size <= table_ - at; }
 
   bool OffsetOf(uint64_t ref, uint64_t* at) const {
@@ -72,7 +88,7 @@ class Reader {
 
   bool Object(uint64_t ref, int depth, Value& out, std::string& error) {
     if (depth > kMaxNesting) return Fail("property list nested too deeply", error);
-    if (++decoded_ > kMaxDecodedObjects) return Fail("binary property list has too many objects", error);
+    if (!Spend(kDecodedObjectCost, error)) return false;
     uint64_t at = 0;
     if (!OffsetOf(ref, &at)) return Fail("malformed binary property list (object offset)", error);
     const uint8_t marker = b_[at++];
@@ -126,6 +142,7 @@ class Reader {
       case 0x5: {
         uint64_t count = 0;
         if (!Count(&at, marker, &count) || !Have(at, count)) return Fail("malformed binary property list (data)", error);
+        if (!Spend(count, error)) return false;
         const char* p = reinterpret_cast<const char*>(b_ + at);
         if (marker >> 4 == 0x4) out = Value::Bytes(Data(b_ + at, b_ + at + count));
         else out = std::string(p, count);
@@ -135,6 +152,7 @@ class Reader {
         uint64_t count = 0;
         if (!Count(&at, marker, &count) || count > table_ || !Have(at, count * 2))
           return Fail("malformed binary property list (text)", error);
+        if (!Spend(count * 3, error)) return false;  // UTF-8 takes up to 3 bytes a unit
         out = Utf16ToUtf8(b_ + at, count);
         return true;
       }
@@ -214,7 +232,8 @@ class Reader {
   const uint8_t* b_;
   uint64_t n_;
   uint8_t offset_size_ = 0, ref_size_ = 0;
-  uint64_t objects_ = 0, table_ = 0, decoded_ = 0;
+  uint64_t objects_ = 0, table_ = 0;
+  uint64_t budget_;  // decoded bytes still allowed
 };
 
 }  // namespace

@@ -128,9 +128,12 @@ std::string Binary(const std::vector<std::string>& objects, uint64_t top, uint8_
     out += o;
   }
   const uint64_t table = out.size();
-  for (uint64_t off : offsets) out += static_cast<char>(off);
+  int offset_size = 1;
+  while (offset_size < 8 && offsets.back() >> (8 * offset_size)) ++offset_size;
+  for (uint64_t off : offsets)
+    for (int i = offset_size - 1; i >= 0; --i) out += static_cast<char>(off >> (8 * i));
   std::string trailer(6, '\0');
-  trailer += static_cast<char>(1);
+  trailer += static_cast<char>(offset_size);
   trailer += static_cast<char>(ref_size);
   auto be = [&](uint64_t v) {
     for (int i = 7; i >= 0; --i) trailer += static_cast<char>(v >> (8 * i));
@@ -158,11 +161,14 @@ TEST(PlistTest, BinaryReaderOnHandMadeAndHostileLists) {
   EXPECT_EQ(d.Get("u"), Value("\xc3\xa9\xf0\x9f\x98\x80"));
 
   // An array that contains itself, and a small file describing a huge tree.
-  EXPECT_EQ(ParsePropertyList(Binary({std::string("\xA1\x00", 2)}, 0)).error, "property list nested too deeply");
+  // (Unreferenced data pads the list so that its size allows the depth.)
+  EXPECT_EQ(ParsePropertyList(Binary({std::string("\xA1\x00", 2), "\x4F\x11\x01\x2C" + std::string(300, 'p')}, 0))
+                .error,
+            "property list nested too deeply");
   std::vector<std::string> chain;
   for (int i = 0; i < 40; ++i) chain.push_back(std::string("\xA2", 1) + static_cast<char>(i + 1) + static_cast<char>(i + 1));
   chain.push_back("\x09");
-  EXPECT_EQ(ParsePropertyList(Binary(chain, 0)).error, "binary property list has too many objects");
+  EXPECT_EQ(ParsePropertyList(Binary(chain, 0)).error, "binary property list too large when decoded");
   // Broken trailers and references.
   const std::string ok = Binary({"\x09"}, 0);
   EXPECT_TRUE(ParsePropertyList(ok).ok());
@@ -173,6 +179,54 @@ TEST(PlistTest, BinaryReaderOnHandMadeAndHostileLists) {
   EXPECT_FALSE(ParsePropertyList(Binary({"\x14\x01"}, 0)).ok());        // short integer
   EXPECT_FALSE(ParsePropertyList(Binary({"\x0F"}, 0)).ok());             // fill byte
   EXPECT_FALSE(ParsePropertyList(Binary({"\x09"}, 0, 9)).ok());          // reference size 9
+}
+
+// An array of refs references to object 1: a string (marker 0x5F) or data
+// (0x4F) of length bytes, or UTF-16 text (0x6F) of length units.
+std::string SharedLeaf(char marker, uint64_t length, uint32_t refs) {
+  auto count = [](uint64_t v) {
+    std::string c = "\x13";
+    for (int i = 7; i >= 0; --i) c += static_cast<char>(v >> (8 * i));
+    return c;
+  };
+  std::string array = "\xAF" + count(refs);
+  for (uint32_t i = 0; i < refs; ++i) array += std::string("\0\0\0\x01", 4);
+  const uint64_t payload = marker == '\x6F' ? 2 * length : length;
+  return Binary({array, marker + count(length) + std::string(payload, 'a')}, 0, 4);
+}
+
+TEST(PlistTest, BinaryReaderBoundsTheDecodedSizeInBytes) {
+  // One 512 KiB string in every slot of a 131,000-slot array: a frame under
+  // 1 MiB that would decode to 64 GiB.
+  const std::string hostile = SharedLeaf('\x5F', 512 << 10, 131'000);
+  EXPECT_LT(hostile.size(), size_t{1} << 20);
+  const ParseResult r = ParsePropertyList(hostile);
+  EXPECT_EQ(r.error, "binary property list too large when decoded");
+  EXPECT_TRUE(r.value.IsNull());
+
+  struct Case {
+    char marker;
+    uint64_t length;
+    uint32_t refs;
+    bool ok;
+  };
+  const Case cases[] = {
+      {'\x5F', 512 << 10, 31, true},    // 15.5 MiB decoded from 512 KiB: within 32 times
+      {'\x5F', 512 << 10, 33, false},   // 16.5 MiB: over 32 times the input
+      {'\x4F', 512 << 10, 33, false},   // data counts as strings do
+      {'\x6F', 256 << 10, 33, false},   // and UTF-16 text as its UTF-8 may be
+      {'\x4F', 3 << 20, 21, true},      // 63 MiB from 3 MiB
+      {'\x4F', 3 << 20, 22, false},     // 66 MiB: within 32 times the input, over 64 MiB
+  };
+  for (const Case& c : cases) {
+    const ParseResult p = ParsePropertyList(SharedLeaf(c.marker, c.length, c.refs));
+    EXPECT_EQ(p.ok(), c.ok) << c.marker << " " << c.length << " x" << c.refs << ": " << p.error;
+    if (c.ok) {
+      ASSERT_EQ(p.value.AsArray()->size(), c.refs);
+      const Value& last = p.value.AsArray()->at(c.refs - 1);
+      EXPECT_EQ(last.AsString() ? last.AsString()->size() : last.AsData()->size(), c.length);
+    }
+  }
 }
 
 TEST(JsonTest, ReadWriteAndMalformed) {

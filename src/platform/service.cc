@@ -8,6 +8,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <thread>
@@ -22,7 +23,7 @@ namespace platform {
 
 class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
  public:
-  XPCConnection(int fd, bool listener, std::string path) : fd_(fd), listener_(listener), path_(std::move(path)) {}
+  XPCConnection(int fd, bool listener, std::string path);
   ~XPCConnection() { Close(); }
 
   void Close();
@@ -33,11 +34,22 @@ class XPCConnection : public std::enable_shared_from_this<XPCConnection> {
   bool listener_;
   bool resumed_ = false;
   std::string path_;  // the socket file of a listener, removed on close
+  dev_t socket_device_ = 0;  // which file at path_ is ours
+  ino_t socket_inode_ = 0;
   xpc_handler_t handler_;
-  std::string buffer_;
+  ServiceFrameReader reader_;
+  // A listener whose accept failed (out of descriptors) is not polled until
+  // this time: its pending peer would make poll return at once, forever.
+  std::chrono::steady_clock::time_point paused_until_{};
+  bool accept_failing_ = false;
 };
 
 namespace {
+
+constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
+
+size_t g_open_peers = 0;
+uint64_t g_poll_calls = 0;
 
 // Connections the run loop watches, in the order they were resumed.
 std::vector<xpc_connection_t>& Watched() {
@@ -65,18 +77,86 @@ uint32_t BigEndian32(const char* p) {
 
 }  // namespace
 
+namespace testing {
+uint64_t ServicePollCalls() { return g_poll_calls; }
+size_t ServiceBufferedBytes() {
+  size_t n = 0;
+  for (const auto& c : Watched()) n += c->reader_.capacity();
+  return n;
+}
+}  // namespace testing
+
+void ServiceFrameReader::Append(std::string_view bytes) {
+  // Drop what was handed out before growing, so the buffer holds at most the
+  // unfinished frame and this chunk.
+  if (start_ > 0) {
+    buffer_.erase(0, start_);
+    start_ = 0;
+  }
+  buffer_.append(bytes);
+}
+
+ServiceFrameReader::Result ServiceFrameReader::Next(cf::Value* message, std::string* error) {
+  const size_t waiting = buffer_.size() - start_;
+  if (waiting >= 4) {
+    const uint32_t length = BigEndian32(buffer_.data() + start_);
+    if (length > kMaxServiceFrame) {
+      if (error) *error = cf::Format("Service message of %u bytes is over the limit of %u", length,
+                                     static_cast<uint32_t>(kMaxServiceFrame));
+      return Result::kBad;
+    }
+    if (waiting - 4 >= length) {
+      std::string reason;
+      *message = DecodeServiceMessage(std::string_view(buffer_).substr(start_ + 4, length), &reason);
+      start_ += 4 + size_t{length};
+      if (message->IsNull()) {
+        if (error) *error = "Bad service message (" + reason + ")";
+        return Result::kBad;
+      }
+      return Result::kMessage;
+    }
+  }
+  // Waiting for more: keep only the unfinished bytes, and give back the room
+  // a large frame left behind, so an idle peer holds next to nothing.
+  if (start_ > 0) {
+    buffer_.erase(0, start_);
+    start_ = 0;
+  }
+  if (buffer_.capacity() > 4096 && buffer_.capacity() > 2 * buffer_.size()) buffer_.shrink_to_fit();
+  return Result::kNeedMore;
+}
+
+XPCConnection::XPCConnection(int fd, bool listener, std::string path)
+    : fd_(fd), listener_(listener), path_(std::move(path)) {
+  if (!listener_ && fd_ >= 0) ++g_open_peers;
+}
+
 void XPCConnection::Close() {
   if (fd_ < 0) return;
   close(fd_);
   fd_ = -1;
-  if (listener_ && !path_.empty()) unlink(path_.c_str());
+  if (!listener_) --g_open_peers;
+  // Remove the socket only while it is still ours: another instance may
+  // have replaced it meanwhile.
+  struct stat st;
+  if (listener_ && !path_.empty() && lstat(path_.c_str(), &st) == 0 && st.st_dev == socket_device_ &&
+      st.st_ino == socket_inode_)
+    unlink(path_.c_str());
 }
 
 bool XPCConnection::OnReady() {
   auto self = shared_from_this();  // a handler may cancel us
   if (listener_) {
     const int peer = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
-    if (peer < 0) return false;
+    if (peer < 0) {
+      if (errno == EINTR || errno == EAGAIN || errno == ECONNABORTED) return false;
+      if (!accept_failing_)
+        LogError("Cannot accept a service connection (%s); pausing the listener", std::strerror(errno));
+      accept_failing_ = true;
+      paused_until_ = std::chrono::steady_clock::now() + kAcceptBackoff;
+      return false;
+    }
+    accept_failing_ = false;
     Deliver(handler_, {XPCEvent::Type::kConnection, std::make_shared<XPCConnection>(peer, false, ""), {}});
     return true;
   }
@@ -86,30 +166,22 @@ bool XPCConnection::OnReady() {
     if (errno == EINTR || errno == EAGAIN) return false;
   }
   if (n <= 0) {
-    if (!buffer_.empty()) LogError("Service peer closed the connection in the middle of a message");
+    if (reader_.mid_frame()) LogError("Service peer closed the connection in the middle of a message");
     Close();
     Unwatch(this);
     Deliver(handler_, {XPCEvent::Type::kError, nullptr, {}});
     return true;
   }
-  buffer_.append(chunk, static_cast<size_t>(n));
+  reader_.Append(std::string_view(chunk, static_cast<size_t>(n)));
   bool delivered = false;
   // Hand over every complete frame; a bad one ends this connection.
-  while (fd_ >= 0 && buffer_.size() >= 4) {
-    const uint32_t length = BigEndian32(buffer_.data());
-    if (length > kMaxServiceFrame) {
-      LogError("Service message of %u bytes is over the limit of %u; closing the connection", length,
-               static_cast<uint32_t>(kMaxServiceFrame));
-      Close();
-      Unwatch(this);
-      return delivered;
-    }
-    if (buffer_.size() < 4 + size_t{length}) break;
+  while (fd_ >= 0) {
+    cf::Value message;
     std::string error;
-    cf::Value message = DecodeServiceMessage(std::string_view(buffer_).substr(4, length), &error);
-    buffer_.erase(0, 4 + size_t{length});
-    if (message.IsNull()) {
-      LogError("Bad service message (%s); closing the connection", error);
+    const ServiceFrameReader::Result result = reader_.Next(&message, &error);
+    if (result == ServiceFrameReader::Result::kNeedMore) break;
+    if (result == ServiceFrameReader::Result::kBad) {
+      LogError("%s; closing the connection", error);
       Close();
       Unwatch(this);
       return delivered;
@@ -186,6 +258,50 @@ bool SendServiceMessage(std::string_view service_name, const cf::Value& message,
 
 using namespace platform;
 
+namespace {
+
+// Makes way for the listener: true when nothing is at path or only a socket
+// that nobody answers (left by a run that died), which is removed. A live
+// socket belongs to another instance, and anything else is not ours to
+// delete; both are reported and left alone.
+bool ClearSocketPath(const std::string& path, const sockaddr_un& addr) {
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0) {
+    if (errno == ENOENT) return true;
+    LogError("Cannot inspect %s: %s", path, std::strerror(errno));
+    return false;
+  }
+  if (!S_ISSOCK(st.st_mode)) {
+    LogError("%s is not a socket; leaving it alone and not serving", path);
+    return false;
+  }
+  const int probe = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+  if (probe < 0) {
+    LogError("Cannot create the service socket: %s", std::strerror(errno));
+    return false;
+  }
+  const int connected = connect(probe, reinterpret_cast<const sockaddr*>(&addr), sizeof addr);
+  const int connect_error = errno;
+  close(probe);
+  // A full backlog (EAGAIN) is a live listener too.
+  if (connected == 0 || connect_error == EAGAIN || connect_error == EINPROGRESS) {
+    LogError("Another instance serves %s; not taking it over", path);
+    return false;
+  }
+  if (connect_error != ECONNREFUSED) {
+    LogError("Cannot tell whether %s is in use (%s); leaving it alone", path, std::strerror(connect_error));
+    return false;
+  }
+  if (unlink(path.c_str()) != 0 && errno != ENOENT) {
+    LogError("Cannot remove the stale socket %s: %s", path, std::strerror(errno));
+    return false;
+  }
+  LogInfo("Removed the stale socket %s", path);
+  return true;
+}
+
+}  // namespace
+
 xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint64_t flags) {
   if (!(flags & XPC_CONNECTION_MACH_SERVICE_LISTENER)) {
     LogError("Only listeners can be created for %s", std::string(name));
@@ -204,22 +320,26 @@ xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint6
     LogError("Cannot create the directory of %s: %s", path, std::strerror(errno));
     return nullptr;
   }
+  if (!ClearSocketPath(path, addr)) return nullptr;
   const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
   if (fd < 0) {
     LogError("Cannot create the service socket: %s", std::strerror(errno));
     return nullptr;
   }
-  unlink(path.c_str());  // a socket left by an earlier run
   // Bind under a strict umask so the socket is 0600 from its first moment.
   const mode_t old_mask = umask(0177);
   const int bound = bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
   umask(old_mask);
-  if (bound != 0 || listen(fd, 16) != 0) {
+  struct stat st;
+  if (bound != 0 || listen(fd, 16) != 0 || lstat(path.c_str(), &st) != 0) {
     LogError("Cannot listen on %s: %s", path, std::strerror(errno));
     close(fd);
     return nullptr;
   }
-  return std::make_shared<XPCConnection>(fd, true, path);
+  auto listener = std::make_shared<XPCConnection>(fd, true, path);
+  listener->socket_device_ = st.st_dev;
+  listener->socket_inode_ = st.st_ino;
+  return listener;
 }
 
 void xpc_connection_set_event_handler(const xpc_connection_t& connection, xpc_handler_t handler) {
@@ -246,7 +366,6 @@ int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled) {
   for (;;) {
     const auto now = Clock::now();
     if (now >= deadline) return kCFRunLoopRunTimedOut;
-    const int wait_ms = static_cast<int>(std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now).count()) + 1;
     std::vector<xpc_connection_t> sources = Watched();
     if (sources.empty()) {
       // The main queue is always a source of the main run loop, so an empty
@@ -254,13 +373,29 @@ int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled) {
       std::this_thread::sleep_for(deadline - now);
       return kCFRunLoopRunTimedOut;
     }
+    // A listener at the connection cap, or paused after a failed accept, is
+    // left out (fd -1) so that its pending peers do not wake the loop.
+    auto wake = deadline;
     std::vector<pollfd> fds;
-    for (const auto& c : sources) fds.push_back({c->fd_, POLLIN, 0});
+    for (const auto& c : sources) {
+      int fd = c->fd_;
+      if (c->listener_) {
+        if (g_open_peers >= kMaxServiceConnections) {
+          fd = -1;
+        } else if (c->paused_until_ > now) {
+          fd = -1;
+          wake = std::min(wake, c->paused_until_);
+        }
+      }
+      fds.push_back({fd, POLLIN, 0});
+    }
+    const int wait_ms = static_cast<int>(std::chrono::duration_cast<std::chrono::milliseconds>(wake - now).count()) + 1;
+    ++g_poll_calls;
     const int ready = poll(fds.data(), fds.size(), wait_ms);
     if (ready < 0 && errno != EINTR) return kCFRunLoopRunStopped;
     bool handled = false;
     for (size_t i = 0; ready > 0 && i < fds.size(); ++i)
-      if (fds[i].revents && sources[i]->fd_ >= 0) handled |= sources[i]->OnReady();
+      if (fds[i].fd >= 0 && fds[i].revents && sources[i]->fd_ >= 0) handled |= sources[i]->OnReady();
     if (handled && returnAfterSourceHandled) return kCFRunLoopRunHandledSource;
   }
 }

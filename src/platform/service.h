@@ -30,6 +30,10 @@ using xpc_handler_t = std::function<void(const XPCEvent&)>;
 
 inline constexpr uint64_t XPC_CONNECTION_MACH_SERVICE_LISTENER = 1;
 inline constexpr size_t kMaxServiceFrame = 1 << 20;
+// Peers served at once. Beyond this the listener is not polled, so further
+// peers wait in the kernel's backlog (their messages are not lost) until
+// one of these closes.
+inline constexpr size_t kMaxServiceConnections = 64;
 
 // Run-loop results.
 inline constexpr int32_t kCFRunLoopRunFinished = 1;
@@ -47,6 +51,32 @@ bool SendServiceMessage(std::string_view service_name, const cf::Value& message,
 bool EncodeServiceFrame(const cf::Value& message, std::string* frame, std::string* error);
 // Parses a frame body; a result that is not a dictionary gives an error.
 cf::Value DecodeServiceMessage(std::string_view body, std::string* error);
+
+// Cuts a connection's byte stream into messages. It holds only the bytes
+// that arrived and are not yet handed out, whatever length a frame announces.
+class ServiceFrameReader {
+ public:
+  enum class Result { kNeedMore, kMessage, kBad };
+  void Append(std::string_view bytes);
+  // The next complete message; kNeedMore until one is complete; kBad (the
+  // reason in *error) for a frame over kMaxServiceFrame or a body that is no
+  // dictionary, after which the stream cannot be trusted.
+  Result Next(cf::Value* message, std::string* error);
+  // Bytes of an unfinished frame are waiting.
+  bool mid_frame() const { return buffer_.size() > start_; }
+  size_t capacity() const { return buffer_.capacity(); }
+
+ private:
+  std::string buffer_;
+  size_t start_ = 0;  // bytes at the front already handed out
+};
+
+namespace testing {
+// How often the run loop has called poll, to see that it does not spin.
+uint64_t ServicePollCalls();
+// The bytes the connections' frame readers hold.
+size_t ServiceBufferedBytes();
+}  // namespace testing
 
 }  // namespace platform
 

@@ -1,11 +1,14 @@
 #include "platform/service.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <thread>
@@ -42,7 +45,6 @@ TEST(ServiceTest, MessagesReachTheHandlerAndBadFramesOnlyEndTheirConnection) {
   auto log = std::make_shared<CaptureLog>();
   ContextScope scope(root.path(), Backends{nullptr, log});
   const std::string path = ServiceSocketPath(kName);
-  ASSERT_TRUE(WriteFileAtomically(path, "stale"));  // an old socket file is replaced
 
   std::vector<cf::Value> messages;
   int errors = 0;
@@ -103,6 +105,221 @@ TEST(ServiceTest, MessagesReachTheHandlerAndBadFramesOnlyEndTheirConnection) {
   std::string error;
   EXPECT_FALSE(SendServiceMessage(kName, message, &error));
   EXPECT_NE(error.find("no service listening at " + path), std::string::npos) << error;
+}
+
+// A client socket connected to path (it waits in the backlog until accepted).
+int Connect(const std::string& path) {
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strcpy(addr.sun_path, path.c_str());
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd >= 0 && connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// A listener that keeps and resumes every peer, counting their messages.
+struct Server {
+  xpc_connection_t listener = xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER);
+  std::vector<xpc_connection_t> peers;
+  size_t messages = 0;
+
+  Server() {
+    if (!listener) return;
+    xpc_connection_set_event_handler(listener, [this](const XPCEvent& e) {
+      peers.push_back(e.connection);
+      xpc_connection_set_event_handler(e.connection, [this](const XPCEvent& m) {
+        if (m.type == XPCEvent::Type::kDictionary) ++messages;
+      });
+      xpc_connection_resume(e.connection);
+    });
+    xpc_connection_resume(listener);
+  }
+  ~Server() {
+    for (auto& p : peers) xpc_connection_cancel(p);
+    xpc_connection_cancel(listener);
+  }
+  // Runs the loop until it has nothing more to do for a moment.
+  void Drain() {
+    while (CFRunLoopRunInMode(0.2, true) != kCFRunLoopRunTimedOut) {
+    }
+  }
+  void RunUntilMessages(size_t n) {
+    for (int i = 0; i < 40 && messages < n; ++i) CFRunLoopRunInMode(0.5, true);
+  }
+  void RunUntilPeers(size_t n) {
+    for (int i = 0; i < 40 && peers.size() < n; ++i) CFRunLoopRunInMode(0.5, true);
+  }
+};
+
+std::string GoodFrame() {
+  cf::Dictionary message;
+  message.Set("operation", cf::Value::SInt64(2));
+  std::string frame;
+  EncodeServiceFrame(message, &frame, nullptr);
+  return frame;
+}
+
+TEST(ServiceTest, TheSocketPathIsTakenOnlyFromADeadListener) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  const std::string path = ServiceSocketPath(kName);
+
+  // Not a socket: reported, left alone, not served.
+  ASSERT_TRUE(WriteFileAtomically(path, "keep me"));
+  EXPECT_EQ(xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER), nullptr);
+  EXPECT_EQ(log->Count(path + " is not a socket; leaving it alone and not serving"), 1u);
+  EXPECT_EQ(ReadFile(path), "keep me");
+  ASSERT_EQ(unlink(path.c_str()), 0);
+
+  // A socket nobody answers (its process died) is replaced.
+  {
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::strcpy(addr.sun_path, path.c_str());
+    const int dead = socket(AF_UNIX, SOCK_STREAM, 0);
+    ASSERT_EQ(bind(dead, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    close(dead);
+  }
+  {
+    Server first;
+    ASSERT_NE(first.listener, nullptr);
+    EXPECT_EQ(log->Count("Removed the stale socket " + path), 1u);
+
+    // A live one belongs to another instance: never unlinked or taken over.
+    struct stat before, after;
+    ASSERT_EQ(stat(path.c_str(), &before), 0);
+    EXPECT_EQ(xpc_connection_create_mach_service(kName, XPC_CONNECTION_MACH_SERVICE_LISTENER), nullptr);
+    EXPECT_EQ(log->Count("Another instance serves " + path + "; not taking it over"), 1u);
+    ASSERT_EQ(stat(path.c_str(), &after), 0);
+    EXPECT_EQ(after.st_ino, before.st_ino);
+    const int client = Connect(path);
+    ASSERT_GE(client, 0);
+    const std::string frame = GoodFrame();
+    ASSERT_EQ(write(client, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+    close(client);
+    first.Drain();
+    EXPECT_EQ(first.messages, 1u);  // the first instance still serves
+  }
+  EXPECT_FALSE(FileExists(path));  // and removes its socket at the end
+
+  // A listener removes the socket at its path only while it is its own.
+  Server replaced;
+  ASSERT_NE(replaced.listener, nullptr);
+  ASSERT_EQ(unlink(path.c_str()), 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strcpy(addr.sun_path, path.c_str());
+  const int other = socket(AF_UNIX, SOCK_STREAM, 0);
+  ASSERT_EQ(bind(other, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  xpc_connection_cancel(replaced.listener);
+  EXPECT_TRUE(FileExists(path));
+  close(other);
+}
+
+TEST(ServiceTest, ConnectionsBeyondTheCapWaitInTheBacklog) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  Server server;
+  ASSERT_NE(server.listener, nullptr);
+  const std::string frame = GoodFrame();
+  std::vector<int> clients;
+  for (size_t i = 0; i < kMaxServiceConnections + 2; ++i) {
+    const int fd = Connect(ServiceSocketPath(kName));
+    ASSERT_GE(fd, 0);
+    ASSERT_EQ(write(fd, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+    clients.push_back(fd);
+    server.RunUntilMessages(std::min(i + 1, kMaxServiceConnections));
+  }
+  server.Drain();
+  EXPECT_EQ(server.peers.size(), kMaxServiceConnections);
+  EXPECT_EQ(server.messages, kMaxServiceConnections);
+  // A peer that goes makes room for one that waited; its message was kept.
+  close(clients[0]);
+  server.Drain();
+  EXPECT_EQ(server.peers.size(), kMaxServiceConnections + 1);
+  EXPECT_EQ(server.messages, kMaxServiceConnections + 1);
+  for (size_t i = 1; i < clients.size(); ++i) close(clients[i]);
+  server.Drain();
+  EXPECT_EQ(server.peers.size(), kMaxServiceConnections + 2);
+  EXPECT_EQ(server.messages, kMaxServiceConnections + 2);
+}
+
+TEST(ServiceTest, OutOfDescriptorsTheListenerPausesInsteadOfSpinning) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  Server server;
+  ASSERT_NE(server.listener, nullptr);
+  const int client = Connect(ServiceSocketPath(kName));
+  ASSERT_GE(client, 0);
+  const std::string frame = GoodFrame();
+  ASSERT_EQ(write(client, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+
+  // Use up every descriptor, so accept fails with EMFILE.
+  rlimit saved;
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
+  rlimit low = saved;
+  low.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 256);
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
+  std::vector<int> filler;
+  for (int fd; (fd = dup(client)) >= 0;) filler.push_back(fd);
+  const uint64_t polls = testing::ServicePollCalls();
+  EXPECT_EQ(CFRunLoopRunInMode(0.5, true), kCFRunLoopRunTimedOut);
+  const uint64_t spent = testing::ServicePollCalls() - polls;
+  for (int fd : filler) close(fd);
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
+  // A spinning loop polls hundreds of thousands of times in half a second;
+  // pausing 100 ms after each failure polls about twice per pause.
+  EXPECT_LE(spent, 30u) << spent;
+  EXPECT_EQ(log->Count("Cannot accept a service connection (Too many open files); pausing the listener"), 1u);
+
+  close(client);
+  server.Drain();
+  EXPECT_EQ(server.messages, 1u);  // served once descriptors are free again
+}
+
+TEST(ServiceTest, AFrameHoldsOnlyTheBytesThatArrived) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  Server server;
+  ASSERT_NE(server.listener, nullptr);
+  const std::string path = ServiceSocketPath(kName);
+
+  // Frames that announce 1 MiB but send ten bytes.
+  std::vector<int> clients;
+  for (int i = 0; i < 20; ++i) {
+    clients.push_back(Connect(path));
+    ASSERT_GE(clients.back(), 0);
+    const std::string partial = Frame(kMaxServiceFrame, std::string(10, 'x'));
+    ASSERT_EQ(write(clients.back(), partial.data(), partial.size()), static_cast<ssize_t>(partial.size()));
+    server.RunUntilPeers(clients.size());
+  }
+  server.Drain();
+  EXPECT_LE(testing::ServiceBufferedBytes(), 20u * 4096);
+  for (int fd : clients) close(fd);
+  server.Drain();
+  EXPECT_EQ(log->Count("Service peer closed the connection in the middle of a message"), 20u);
+
+  // A large message delivered leaves no large buffer behind on an idle peer.
+  cf::Dictionary big;
+  big.Set("padding", cf::Value::Bytes(cf::Data(kMaxServiceFrame - 1024, 1)));
+  std::string frame;
+  ASSERT_TRUE(EncodeServiceFrame(big, &frame, nullptr));
+  const int client = Connect(path);
+  ASSERT_GE(client, 0);
+  std::thread writer([&] { (void)!write(client, frame.data(), frame.size()); });
+  server.RunUntilMessages(1);
+  writer.join();
+  server.Drain();
+  EXPECT_LE(testing::ServiceBufferedBytes(), 4096u);
+  close(client);
+  server.Drain();
 }
 
 TEST(ServiceTest, AFileWhereTheSocketDirectoryBelongsIsReportedAsSuch) {

@@ -55,8 +55,7 @@ bool SwapTotal(uint64_t* bytes) {
 
 int Sysctl(const char* name, void* buffer, size_t* size) {
   if (!name || !buffer || !size) return Fail(EINVAL);
-  const cf::Dictionary profile = ReadProfileDictionary("/device/sysctl.plist");
-  const cf::Value& v = profile.Get(name);
+  const cf::Value v = ReadProfileEntry("/device/sysctl.plist", name);
   if (const cf::Number* n = v.AsNumber()) {
     const uint64_t value = n->AsUInt64();
     if (*size == 8) return CopyOut(&value, 8, buffer, size);
@@ -156,7 +155,7 @@ cf::Array preferredLanguages() {
 }
 
 cf::Array systemLanguages() {
-  const cf::Value v = platform::ReadProfileDictionary("/device/answers.plist").Get("SystemLanguages");
+  const cf::Value v = platform::ReadProfileEntry("/device/answers.plist", "SystemLanguages");
   cf::Array out;
   if (const cf::Array* a = v.AsArray())
     for (const cf::Value& item : *a)

@@ -1,6 +1,9 @@
 #include "platform/system.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
@@ -12,6 +15,7 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "platform/profile.h"
 #include "platform/services.h"
 
 namespace platform {
@@ -102,6 +106,106 @@ TEST_F(SystemTest, KernelVariablesAndTheirSizes) {
     EXPECT_EQ(std::string(uuid).size(), 36u);
   }
   EXPECT_GE(PageSize(), 4096u);
+}
+
+TEST_F(SystemTest, DeviceFilesAreReadOnlyWhenRegularAndSmall) {
+  ASSERT_TRUE(MakeDirectories(root / "device"));
+  // A FIFO must neither block the run nor be read.
+  const std::string sysctl = root / "device/sysctl.plist";
+  ASSERT_EQ(mkfifo(sysctl.c_str(), 0600), 0);
+  uint64_t u64 = 0;
+  size_t size = 8;
+  for (int i = 0; i < 3; ++i) {
+    errno = 0;
+    EXPECT_EQ(Sysctl("kern.any", &u64, &size), -1);
+    EXPECT_EQ(errno, ENOENT);
+  }
+  EXPECT_EQ(log->Count(sysctl + " is not a regular file; ignoring it"), 1u);
+
+  // A device behind a link would never end.
+  const std::string answers = root / "device/answers.plist";
+  ASSERT_EQ(symlink("/dev/zero", answers.c_str()), 0);
+  EXPECT_EQ(cf::Value(systemLanguages()), cf::Value(cf::Array({cf::Value("en")})));
+  EXPECT_TRUE(ReadProfileDictionary("/device/answers.plist").empty());
+  EXPECT_EQ(log->Count(answers + " is not a regular file; ignoring it"), 1u);
+
+  // Up to 16 MiB is read; one byte more is refused, with one line however often it is asked for.
+  auto apps_of_size = [&](size_t total) {
+    const std::string head = "<plist version=\"1.0\"><array><dict><key>bundleIdentifier</key><string>";
+    const std::string tail = "</string><key>bundleType</key><string>User</string></dict></array></plist>";
+    ASSERT_TRUE(WriteFileAtomically(root / "device/apps.plist",
+                                    head + std::string(total - head.size() - tail.size(), 'a') + tail));
+  };
+  auto app_ids = [] {
+    std::vector<size_t> sizes;
+    LSApplicationWorkspace::defaultWorkspace().enumerateBundlesOfType(
+        1, [&](const LSBundleProxy& b) { sizes.push_back(b.bundleIdentifier.size()); });
+    return sizes;
+  };
+  apps_of_size(16 << 20);
+  ASSERT_EQ(app_ids().size(), 1u);
+  apps_of_size((16 << 20) + 1);
+  EXPECT_TRUE(app_ids().empty());
+  EXPECT_TRUE(app_ids().empty());
+  EXPECT_EQ(log->Count(root / "device/apps.plist is 16777217 bytes, over the limit of 16777216; ignoring it"), 1u);
+  apps_of_size(17 << 20);
+  EXPECT_TRUE(app_ids().empty());
+  EXPECT_EQ(log->CountContaining("over the limit of 16777216"), 2u);
+}
+
+TEST_F(SystemTest, DeviceFileIsParsedOnceUntilItsStampChanges) {
+  const std::string sysctl = root / "device/sysctl.plist";
+  ASSERT_TRUE(WriteFileAtomically(sysctl, "not a property list"));
+  uint64_t u64 = 0;
+  size_t size = 8;
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(Sysctl("kern.v", &u64, &size), -1);
+  const std::string bad = sysctl + " is not a property list (";
+  EXPECT_EQ(log->CountContaining(bad), 1u);
+  {
+    ContextScope other(root.path(), Backends{clock, log});  // another context parses for itself
+    EXPECT_EQ(Sysctl("kern.v", &u64, &size), -1);
+    EXPECT_EQ(log->CountContaining(bad), 2u);
+  }
+
+  Write("device/sysctl.plist", cf::Array());
+  for (int i = 0; i < 3; ++i) EXPECT_EQ(Sysctl("kern.v", &u64, &size), -1);
+  EXPECT_EQ(log->Count(sysctl + " is an array, not a dictionary; ignoring it"), 1u);
+
+  // Rewritten in place with the same size: the stamp's nanoseconds tell.
+  auto rewrite = [&](int64_t value, timespec modified) {
+    cf::Dictionary d;
+    d.Set("kern.v", cf::Value::SInt64(value));
+    std::string bytes;
+    ASSERT_TRUE(cf::WriteXMLPropertyList(d, bytes, nullptr));
+    const int fd = open(sysctl.c_str(), O_WRONLY | O_TRUNC);
+    ASSERT_GE(fd, 0);
+    ASSERT_EQ(write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+    const timespec times[2] = {modified, modified};
+    ASSERT_EQ(futimens(fd, times), 0);
+    close(fd);
+  };
+  auto read = [&] {
+    u64 = 0;
+    EXPECT_EQ(Sysctl("kern.v", &u64, &size), 0);
+    return u64;
+  };
+  rewrite(1, {1'700'000'000, 0});
+  EXPECT_EQ(read(), 1u);
+  rewrite(2, {1'700'000'000, 0});
+  EXPECT_EQ(read(), 1u);  // same stamp: the parse already made stands
+  rewrite(2, {1'700'000'000, 1});
+  EXPECT_EQ(read(), 2u);
+  // Stamped just now, a second write can share the stamp of the first (the
+  // file system's clock is coarse): then the content tells.
+  timespec now;
+  clock_gettime(CLOCK_REALTIME, &now);
+  rewrite(3, now);
+  EXPECT_EQ(read(), 3u);
+  rewrite(4, now);
+  EXPECT_EQ(read(), 4u);
+  ASSERT_EQ(unlink(sysctl.c_str()), 0);
+  EXPECT_EQ(Sysctl("kern.v", &u64, &size), -1);
+  EXPECT_EQ(log->CountContaining(sysctl), 3u);  // no line for the good or missing file
 }
 
 TEST_F(SystemTest, TimebaseAppsAndVersion) {
