@@ -173,6 +173,28 @@ cf::Value ReadProfileEntry(const std::string& device_path, std::string_view key)
   return v.IsNull() ? cf::Value() : v.AsDictionary()->Get(std::string(key)).DeepCopy();
 }
 
+std::optional<std::string> ReadDeviceBytes(const std::string& device_path, std::string* error) {
+  const std::string path = Context::Current().Path(device_path);
+  const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
+  if (fd < 0) {
+    if (errno != ENOENT && error) *error = cf::Format("Cannot read %s: %s", path, std::strerror(errno));
+    return std::nullopt;
+  }
+  struct stat st;
+  std::string bytes;
+  std::string why = fstat(fd, &st) != 0 ? cf::Format("Cannot read %s: %s", path, std::strerror(errno)) : Refusal(st, path);
+  if (why.empty() && !ReadAll(fd, kMaxProfileFileBytes, &bytes)) why = cf::Format("Cannot read %s: %s", path, std::strerror(errno));
+  if (why.empty() && static_cast<int64_t>(bytes.size()) > kMaxProfileFileBytes)
+    why = cf::Format("%s grew over the limit of %lld bytes while read; ignoring it", path,
+                     static_cast<long long>(kMaxProfileFileBytes));
+  close(fd);
+  if (!why.empty()) {
+    if (error) *error = why;
+    return std::nullopt;
+  }
+  return bytes;
+}
+
 std::map<std::string, std::string> ReadOsRelease() {
   std::map<std::string, std::string> out;
   const auto text = ReadFile("/etc/os-release");

@@ -8,6 +8,7 @@
 
 #include <cstdint>
 #include <map>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -24,6 +25,10 @@ cf::Dictionary ReadProfileDictionary(const std::string& device_path);
 cf::Value ReadProfileValue(const std::string& device_path);
 // One entry of ReadProfileDictionary, without copying the rest.
 cf::Value ReadProfileEntry(const std::string& device_path, std::string_view key);
+
+// The raw bytes of a device file under the same rules; nothing when it is
+// missing (*error empty) or refused (*error says why).
+std::optional<std::string> ReadDeviceBytes(const std::string& device_path, std::string* error);
 
 // KEY=value pairs of /etc/os-release, quotes removed.
 std::map<std::string, std::string> ReadOsRelease();

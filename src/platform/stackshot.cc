@@ -34,14 +34,11 @@ int stackshot_capture_with_config(stackshot_config_t* config) {
   if (!config || !config->flags_set) return EINVAL;
   const platform::Context& context = platform::Context::Current();
   std::string error;
-  const std::string raw_path = context.Path("/device/stackshot.kcdata");
-  if (platform::FileExists(raw_path)) {
-    auto raw = platform::ReadFile(raw_path, &error);
-    if (!raw) {
-      platform::LogError("%s", error);
-      return EIO;
-    }
+  if (auto raw = platform::ReadDeviceBytes("/device/stackshot.kcdata", &error)) {
     config->bytes = std::move(*raw);
+  } else if (!error.empty()) {
+    platform::LogError("%s", error);
+    return EIO;
   } else {
     const cf::Value tasks = platform::ReadProfileValue("/device/stackshot.plist");
     if (tasks.IsNull()) return ENOENT;
