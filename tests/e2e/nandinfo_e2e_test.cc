@@ -61,3 +61,23 @@ TEST_F(NANDInfoRun, WithoutAControllerNothingIsWritten) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(NANDInfoRun, DevsimShowsTheControllerOfARoot) {
+  const RunResult shown = RunProgram(DEVSIM_BIN, {"controller", root.path()}, env);
+  ASSERT_EQ(shown.status, 0) << shown.err;
+  const cf::Value json = cf::ParseJSON(shown.out).value;
+  ASSERT_NE(json.AsDictionary(), nullptr) << shown.out;
+  EXPECT_EQ(json.AsDictionary()->Get("com.velmora.NANDInfo.NumLogicalWrites").AsNumber()->AsSInt64(), 1843261440);
+  EXPECT_EQ(json.AsDictionary()->Get("com.velmora.NANDInfo.VMFreezer.NumPhysicalWrites").AsNumber()->AsSInt64(),
+            2147483648);
+
+  WritePlist("device/registry.plist", cf::Array());
+  const RunResult none = RunProgram(DEVSIM_BIN, {"controller", root.path()}, env);
+  EXPECT_EQ(none.status, 1);
+  EXPECT_NE(none.err.find("devsim: the controller of " + root.path() + " could not be read"), std::string::npos)
+      << none.err;
+}
+
+}  // namespace
