@@ -5,6 +5,7 @@
 #include <thread>
 
 #include "../../tests/temp_dir.h"
+#include "../../tests/test_values.h"
 #include "cf/plist.h"
 #include "nandinfo/controller.h"
 #include "parsers/context.h"
@@ -15,12 +16,6 @@
 #include "sim/kcdata.h"
 
 namespace {
-
-cf::Dictionary Dict(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
-  cf::Dictionary d;
-  for (const auto& [k, v] : entries) d.Set(k, v);
-  return d;
-}
 
 class NANDInfoTest : public ::testing::Test {
  protected:

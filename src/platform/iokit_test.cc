@@ -7,6 +7,7 @@
 #include <thread>
 
 #include "../../tests/temp_dir.h"
+#include "../../tests/test_values.h"
 #include "cf/plist.h"
 #include "parsers/parsers.h"
 #include "platform/context.h"
@@ -22,14 +23,6 @@ cf::Dictionary Service(const char* cls, uint64_t id, std::initializer_list<std::
   d.Set("class", cls);
   d.Set("id", cf::Value::UInt64(id));
   for (const auto& [k, v] : more) d.Set(k, v);
-  return d;
-}
-
-cf::Value Raw(const std::string& bytes) { return cf::Value::Bytes(cf::Data(bytes.begin(), bytes.end())); }
-
-cf::Dictionary Props(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
-  cf::Dictionary d;
-  for (const auto& [k, v] : entries) d.Set(k, v);
   return d;
 }
 
@@ -71,12 +64,12 @@ class IOKitTest : public ::testing::Test {
 };
 
 TEST_F(IOKitTest, MatchingPropertiesAndHandles) {
-  cf::Dictionary chars = Props({{"chip-id", "K3R"}});
+  cf::Dictionary chars = Dict({{"chip-id", "K3R"}});
   Write("registry.plist",
-        cf::Array({Service("Root", 1, {{"properties", Props({{"IOReportLegend", "legend"}, {"model", "x"}})}}),
+        cf::Array({Service("Root", 1, {{"properties", Dict({{"IOReportLegend", "legend"}, {"model", "x"}})}}),
                    Service("VelmoraVNS3NVMeController", 7,
                            {{"name", "nvme0"}, {"parent", cf::Value::UInt64(1)},
-                            {"properties", Props({{"Controller Characteristics", chars}, {"model", "y"}})}}),
+                            {"properties", Dict({{"Controller Characteristics", chars}, {"model", "y"}})}}),
                    Service("VelmoraVNS3NVMeController", 8, {{"parent", cf::Value::UInt64(1)}})}));
   EXPECT_EQ(IOServiceGetMatchingService(kIOMainPortDefault, IOServiceMatching("Nothing")), 0u);
   const io_service_t s = IOServiceGetMatchingService(kIOMainPortDefault, IOServiceMatching("VelmoraVNS3NVMeController"));
@@ -97,13 +90,13 @@ TEST_F(IOKitTest, MatchingPropertiesAndHandles) {
 
   // Property matching: every listed property present and equal.
   cf::Dictionary by_property;
-  by_property.Set("IOPropertyMatch", Props({{"Controller Characteristics", chars}}));
+  by_property.Set("IOPropertyMatch", Dict({{"Controller Characteristics", chars}}));
   io_iterator_t it = 0;
   ASSERT_EQ(IOServiceGetMatchingServices(kIOMainPortDefault, by_property, &it), kIOReturnSuccess);
   const io_object_t only = IOIteratorNext(it);
   EXPECT_NE(only, 0u);
   EXPECT_EQ(IOIteratorNext(it), 0u);
-  by_property.Set("IOPropertyMatch", Props({{"Controller Characteristics", chars}, {"model", "x"}}));
+  by_property.Set("IOPropertyMatch", Dict({{"Controller Characteristics", chars}, {"model", "x"}}));
   EXPECT_EQ(IOServiceGetMatchingService(kIOMainPortDefault, by_property), 0u);
 
   // References: a retained object needs two releases; then it is gone, and
@@ -239,7 +232,7 @@ TEST_F(IOKitTest, ConnectionsAndTheControllersTunnel) {
   EXPECT_EQ(out, 1u);
   EXPECT_EQ(out_size, 4u);
   controller.Set("contentDeletion", Raw(std::string("\x01\x00", 2)));
-  controller.Set("stats", Props({{"noSuchField", cf::Value::SInt32(1)}}));
+  controller.Set("stats", Dict({{"noSuchField", cf::Value::SInt32(1)}}));
   std::this_thread::sleep_for(std::chrono::milliseconds(5));
   Write("controller.plist", controller);
   out_size = 4;

@@ -129,46 +129,57 @@ bool FieldValues(const cf::Value& name, const cf::Value& value, uint64_t max_val
   return ok;
 }
 
-template <typename Field, typename Fields>
-const Field* ByName(const Fields& fields, const std::string& name) {
-  for (const Field& f : fields)
-    if (name == f.name) return &f;
+template <typename Fields>
+auto FindByName(const Fields& table, const cf::Value& name) -> decltype(&table[0]) {
+  if (const std::string* text = name.AsString())
+    for (const auto& row : table)
+      if (*text == row.name) return &row;
   return nullptr;
+}
+
+// Walks a field dictionary: each name looked up in the table, its values
+// checked, then handed to add(field, name, values) to encode.
+template <typename Fields, typename Add>
+bool EncodeFields(const cf::Dictionary& fields, const Fields& table, const char* kind, uint64_t max_value,
+                  std::string* error, Add add) {
+  for (const auto& [name, value] : fields) {
+    const auto* f = FindByName(table, name);
+    if (!f) {
+      if (error) *error = std::string("unknown ") + kind + " field \"" + name.Description() + "\"";
+      return false;
+    }
+    std::vector<uint64_t> values;
+    if (!FieldValues(name, value, max_value, &values, error) || !add(*f, name, values)) return false;
+  }
+  return true;
 }
 
 }  // namespace
 
 std::optional<std::string> EncodeFtlFields(const cf::Dictionary& fields, std::string* error) {
   WordRecordBuffer b;
-  for (const auto& [name, value] : fields) {
-    const parsers::FtlField* f = name.AsString() ? ByName<parsers::FtlField>(parsers::FtlFields(), *name.AsString()) : nullptr;
-    if (!f) {
-      if (error) *error = "unknown FTL field \"" + name.Description() + "\"";
-      return std::nullopt;
-    }
-    std::vector<uint64_t> payload;
-    if (!FieldValues(name, value, UINT64_MAX, &payload, error)) return std::nullopt;
-    b.Record(f->key, payload);
-  }
+  const bool ok = EncodeFields(fields, parsers::FtlFields(), "FTL", UINT64_MAX, error,
+                               [&](const parsers::FtlField& f, const cf::Value&, const std::vector<uint64_t>& values) {
+                                 b.Record(f.key, values);
+                                 return true;
+                               });
+  if (!ok) return std::nullopt;
   return b.End().bytes();
 }
 
 std::optional<std::string> EncodeMspFields(const cf::Dictionary& fields, std::string* error) {
   ByteRecordBuffer b;
-  for (const auto& [name, value] : fields) {
-    const parsers::MspField* f = name.AsString() ? ByName<parsers::MspField>(parsers::MspFields(), *name.AsString()) : nullptr;
-    if (!f) {
-      if (error) *error = "unknown MSP field \"" + name.Description() + "\"";
-      return std::nullopt;
-    }
-    std::vector<uint64_t> values;
-    if (!FieldValues(name, value, UINT32_MAX, &values, error)) return std::nullopt;
-    if (values.size() > 0xFFFF / 4) {
-      if (error) *error = "field \"" + name.Description() + "\": more values than a record holds";
-      return std::nullopt;
-    }
-    b.Record(static_cast<uint16_t>(f->key), std::vector<uint32_t>(values.begin(), values.end()));
-  }
+  const bool ok = EncodeFields(
+      fields, parsers::MspFields(), "MSP", UINT32_MAX, error,
+      [&](const parsers::MspField& f, const cf::Value& name, const std::vector<uint64_t>& values) {
+        if (values.size() > 0xFFFF / 4) {
+          if (error) *error = "field \"" + name.Description() + "\": more values than a record holds";
+          return false;
+        }
+        b.Record(static_cast<uint16_t>(f.key), std::vector<uint32_t>(values.begin(), values.end()));
+        return true;
+      });
+  if (!ok) return std::nullopt;
   return b.End().bytes();
 }
 
