@@ -1,16 +1,31 @@
 #include "collect/collect.h"
 
+#include <errno.h>
+
+#include <algorithm>
+#include <string>
+
 #include "nandinfo/nandinfo.h"
+#include "platform/diagnostics.h"
 #include "platform/log.h"
 #include "platform/store.h"
+#include "platform/system.h"
 
 using platform::LogDefault;
 
 namespace {
 
-// Step 1: the disk's capacity and free space. (A seam until the collection
-// work builds it.)
-void CollectDiskUsage() {}
+// Step 1: the disk's capacity and free space in MiB, -1 where unknown.
+void CollectDiskUsage() {
+  const cf::Value usage = DVCopyAnswer(kDVQDiskUsage);
+  const cf::Dictionary* d = usage.AsDictionary();
+  auto mib = [&](const char* entry) {
+    const cf::Number* n = d ? d->Get(entry).AsNumber() : nullptr;
+    return n ? n->AsSInt64() >> 20 : int64_t{-1};
+  };
+  TBClientSetValueForScalarKey("com.velmora.homedeck.DiskUsageUserTotalBlocks", mib(kDVQDiskUsageTotalDiskCapacity));
+  TBClientSetValueForScalarKey("com.velmora.homedeck.DiskUsageUserBlocksFree", mib(kDVQDiskUsageTotalDataAvailable));
+}
 
 // Step 2: the storage structured log. (A seam until the storage log is built.)
 void CollectStorageStructuredLog() {}
@@ -37,9 +52,32 @@ void CollectNANDInfo() {
   });
 }
 
-// Step 4: the kernel's pending ECC events. (A seam until the collection work
-// builds it.)
-void CollectECCEvents() {}
+// Step 4: up to ten of the kernel's pending ECC events, each to the
+// structured-data log.
+void CollectECCEvents() {
+  struct EccEventRecord {
+    uint8_t id;
+    uint8_t count;
+    uint8_t padding[6];
+    int64_t reg[8];
+  } record{};
+  static_assert(sizeof(EccEventRecord) == 72);
+  size_t size = sizeof record;
+  bool failed = platform::Sysctl("kern.next_ecc_event", &record, &size) != 0;
+  for (int allowed = 10; !failed && allowed > 0; --allowed) {
+    cf::Dictionary event;
+    event.Set("id", cf::Value::SInt32(record.id));
+    event.Set("count", cf::Value::SInt32(record.count));
+    // The record holds eight registers; a larger count names no more.
+    for (int i = 0; i < std::min<int>(record.count, 8); ++i)
+      event.Set("reg" + std::to_string(i), cf::Value::SInt64(record.reg[i]));
+    FKLogStructuredData(172, event);
+    // The size keeps what the last read stored, as the kernel's callers do.
+    failed = platform::Sysctl("kern.next_ecc_event", &record, &size) != 0;
+  }
+  // Only a failed read says why the reading stopped.
+  if (failed && errno != ENOENT && errno != EBUSY) LogDefault("Unexpected errno (%d) reading ECC events from kernel", errno);
+}
 
 // Step 5: per-process network usage. (A seam until the collection work builds it.)
 void CollectDataUsage() {}

@@ -183,28 +183,66 @@ bool DVGetBoolAnswer(std::string_view question) { return BoolAnswer(question, fa
 
 bool DiagnosticLogSubmissionEnabled() { return BoolAnswer("DiagnosticLogSubmissionEnabled", true); }
 
+namespace {
+constexpr const char* kStructuredPrefix = "structured_";
+constexpr const char* kStructuredSuffix = ".jsonl";
+
+// The day in a name such as "structured_2026-11-21.jsonl" (YYYY-MM-DD,
+// compared as text), or empty.
+std::string DayInName(const std::string& name) {
+  const std::string prefix = kStructuredPrefix, suffix = kStructuredSuffix;
+  if (name.size() != prefix.size() + 10 + suffix.size() || name.compare(0, prefix.size(), prefix) != 0 ||
+      name.compare(name.size() - suffix.size(), suffix.size(), suffix) != 0)
+    return {};
+  const std::string day = name.substr(prefix.size(), 10);
+  for (size_t i = 0; i < day.size(); ++i)
+    if (i == 4 || i == 7 ? day[i] != '-' : !std::isdigit(static_cast<unsigned char>(day[i]))) return {};
+  return day;
+}
+}  // namespace
+
+bool FKLogStructuredData(int type, const cf::Value& record) {
+  const double now = Now();
+  cf::Dictionary line;
+  line.Set("time", cf::ISO8601(cf::Date{now}));
+  line.Set("type", cf::Value::SInt32(type));
+  line.Set("record", record);
+  std::string json, error;
+  const std::string path = Context::Current().Path("/var/faultkeep/") + kStructuredPrefix +
+                           LocalStamp(now, "%Y-%m-%d") + kStructuredSuffix;
+  if (!cf::WriteJSON(line, json, &error) || !AppendToFile(path, json + "\n", &error)) {
+    LogError("Cannot log structured data of type %d: %s", type, error);
+    return false;
+  }
+  return true;
+}
+
 void FKDumpAllOldStructuredDataLogs() {
   const std::string path = Context::Current().Path("/var/faultkeep");
-  const double today_start = StartOfDay(TBDaysSince1970());
+  const std::string today = LocalStamp(StartOfDay(TBDaysSince1970()), "%Y-%m-%d");
   std::optional<Directory> dir;
   std::optional<Directory> old_dir;
   std::string error;
   for (const Entry& e : RegularFiles(path)) {
-    if (static_cast<double>(e.mtime_ns) / 1e9 >= today_start) continue;
+    // A log named for its day rolls by that day, so a clock fixed by
+    // TALLYRUN_NOW never moves a file written earlier in the same run.
+    const std::string named = DayInName(e.name);
+    const std::string day = named.empty() ? LocalStamp(static_cast<double>(e.mtime_ns) / 1e9, "%Y-%m-%d") : named;
+    if (day >= today) continue;
     if (!dir) dir = Directory::Open(path, false, &error);
     if (dir && !old_dir) old_dir = Directory::Open(path + "/old", true, &error);
     if (!dir || !old_dir) {
       LogError("%s", error);
       return;
     }
-    // Keep the day the file was last written in its new name.
+    // Another file keeps the day it was last written in its new name.
     const size_t dot = e.name.find_last_of('.');
     const std::string stem = dot == std::string::npos || dot == 0 ? e.name : e.name.substr(0, dot);
     const std::string ext = dot == std::string::npos || dot == 0 ? "" : e.name.substr(dot);
-    const std::string day = LocalStamp(static_cast<double>(e.mtime_ns) / 1e9, "%Y-%m-%d");
+    const std::string base = named.empty() ? stem + "-" + day : stem;
     bool moved = false;
     for (int n = 0; n < 1000 && !moved; ++n) {
-      moved = dir->MoveTo(e.name, *old_dir, stem + "-" + day + (n ? "-" + std::to_string(n) : "") + ext, &error);
+      moved = dir->MoveTo(e.name, *old_dir, base + (n ? "-" + std::to_string(n) : "") + ext, &error);
       if (!moved && errno != EEXIST) break;
     }
     if (!moved) LogError("%s", error);

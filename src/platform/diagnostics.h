@@ -45,8 +45,15 @@ inline constexpr const char* kDVQDiskUsage = "DiskUsage";
 inline constexpr const char* kDVQDiskUsageTotalDiskCapacity = "TotalDiskCapacity";
 inline constexpr const char* kDVQDiskUsageTotalDataAvailable = "TotalDataAvailable";
 
-// Moves structured-data log files last written before today from
-// $ROOT/var/faultkeep/ into $ROOT/var/faultkeep/old/. Never fails the caller.
+// Appends one record as a JSON line {"time", "type", "record"} (data in
+// base64) to $ROOT/var/faultkeep/structured_<YYYY-MM-DD>.jsonl, dated by the
+// platform clock in local time. False (with an error line) when it cannot.
+bool FKLogStructuredData(int type, const cf::Value& record);
+
+// Moves the structured-data logs of days before today from
+// $ROOT/var/faultkeep/ into $ROOT/var/faultkeep/old/: a log named for its
+// day by that day, any other file by the day it was last written (which its
+// new name then carries). Never fails the caller.
 void FKDumpAllOldStructuredDataLogs();
 // Keeps the newest 7 files of $ROOT/var/halvern/ and removes the rest.
 void rollHalvernLogs();

@@ -121,6 +121,28 @@ TEST_F(DiagnosticsTest, HousekeepingMovesOldLogsKeepsSevenAndPosts) {
   EXPECT_EQ(Files("var/faultkeep"), (std::vector<std::string>{"fresh.jsonl", "old"}));
   EXPECT_EQ(Files("var/faultkeep/old"),
             (std::vector<std::string>{"structured-2026-11-20.jsonl", "structured-2026-11-21.jsonl"}));
+  // Logs named for their day roll by that day, whatever their stamp: one
+  // written "today" by a fixed clock stays, yesterday's goes under its name.
+  Touch("var/faultkeep/structured_2026-11-22.jsonl", today - 86400 * 5);
+  Touch("var/faultkeep/structured_2026-11-21.jsonl", today + 3600);
+  FKDumpAllOldStructuredDataLogs();
+  EXPECT_EQ(Files("var/faultkeep"), (std::vector<std::string>{"fresh.jsonl", "old", "structured_2026-11-22.jsonl"}));
+  EXPECT_EQ(Files("var/faultkeep/old"), (std::vector<std::string>{"structured-2026-11-20.jsonl",
+                                                                   "structured-2026-11-21.jsonl",
+                                                                   "structured_2026-11-21.jsonl"}));
+  std::filesystem::remove(root / "var/faultkeep/structured_2026-11-22.jsonl");
+  cf::Dictionary record;
+  record.Set("id", cf::Value::SInt32(7));
+  record.Set("blob", cf::Value::Bytes(cf::Data{1, 2, 255}));
+  ASSERT_TRUE(FKLogStructuredData(172, record));
+  const std::string line = *ReadFile(root / "var/faultkeep/structured_2026-11-22.jsonl");
+  ASSERT_EQ(line.back(), '\n');
+  const cf::Value logged = cf::ParseJSON(line).value;
+  ASSERT_NE(logged.AsDictionary(), nullptr) << line;
+  EXPECT_EQ(logged.AsDictionary()->Get("time"), cf::Value("2026-11-22T10:20:30Z"));
+  EXPECT_EQ(logged.AsDictionary()->Get("type"), cf::Value::SInt32(172));
+  record.Set("blob", "AQL/");  // data in base64
+  EXPECT_EQ(logged.AsDictionary()->Get("record"), cf::Value(record));
   FKDumpAllOldStructuredDataLogs();  // nothing left to move; no directory: no failure
   TempDir empty;
   { ContextScope s(empty.path(), Backends{clock, log}); FKDumpAllOldStructuredDataLogs(); rollHalvernLogs(); }

@@ -5,7 +5,10 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <optional>
+#include <string_view>
 
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/files.h"
@@ -53,8 +56,82 @@ bool SwapTotal(uint64_t* bytes) {
 
 }  // namespace
 
+namespace {
+
+constexpr const char* kEccQueue = "/device/ecc-events.plist";
+constexpr size_t kEccRecordSize = 72;
+
+// The 72-byte record of an ECC event: id, count, six bytes of padding and
+// eight signed 64-bit registers, little-endian.
+std::optional<std::string> EccRecord(const cf::Dictionary& event) {
+  const cf::Number* id = event.Get("id").AsNumber();
+  const cf::Number* count = event.Get("count").AsNumber();
+  const cf::Array* regs = event.Get("reg").AsArray();
+  if (!id || !count || (!event.Get("reg").IsNull() && !regs) || (regs && regs->size() > 8)) return std::nullopt;
+  std::string record(kEccRecordSize, '\0');
+  record[0] = static_cast<char>(id->AsUInt32());
+  record[1] = static_cast<char>(count->AsUInt32());
+  for (size_t i = 0; regs && i < regs->size(); ++i) {
+    const cf::Number* r = (*regs)[i].AsNumber();
+    if (!r) return std::nullopt;
+    const int64_t v = r->AsSInt64();
+    std::memcpy(record.data() + 8 + 8 * i, &v, 8);
+  }
+  return record;
+}
+
+// "kern.next_ecc_event" as the kernel keeps it: each successful read takes
+// the next event of device/ecc-events.plist, and the queue is written back
+// without it before the event is answered, so a consumed event is gone for
+// the next run even after a crash, and never read twice. {"errno": N} as the
+// next item fails that read with N, and is consumed too. No file: 1.
+int NextEccEvent(void* buffer, size_t* size, bool* handled) {
+  const cf::Value queue = ReadProfileValue(kEccQueue);
+  *handled = !queue.IsNull();
+  if (!*handled) return 0;
+  const cf::Array* items = queue.AsArray();
+  if (!items) {
+    LogError("%s must be an array of events", Context::Current().Path(kEccQueue));
+    return Fail(EINVAL);
+  }
+  if (items->empty()) return Fail(ENOENT);
+  const cf::Value& next = (*items)[0];
+  std::optional<std::string> bytes;
+  int error = 0;
+  if (const cf::Data* d = next.AsData()) {
+    bytes = std::string(reinterpret_cast<const char*>(d->data()), d->size());
+  } else if (const cf::Dictionary* e = next.AsDictionary(); e && e->Get("errno").AsNumber()) {
+    error = e->Get("errno").AsNumber()->AsSInt32();
+  } else if (e) {
+    bytes = EccRecord(*e);
+  }
+  if (!bytes && !error) {
+    LogError("%s: the next event is not {\"id\", \"count\", \"reg\"}, {\"errno\"} or data; it is skipped",
+             Context::Current().Path(kEccQueue));
+    error = EINVAL;
+  }
+  if (bytes && *size < bytes->size()) return Fail(ENOMEM);  // not consumed: the caller may ask again
+  cf::Array rest;
+  for (size_t i = 1; i < items->size(); ++i) rest.Append((*items)[i]);
+  std::string xml, why;
+  if (!cf::WriteXMLPropertyList(cf::Value(rest), xml, &why) ||
+      !WriteFileAtomically(Context::Current().Path(kEccQueue), xml, &why)) {
+    LogError("Cannot consume an ECC event: %s", why);
+    return Fail(EIO);
+  }
+  if (error) return Fail(error);
+  return CopyOut(bytes->data(), bytes->size(), buffer, size);
+}
+
+}  // namespace
+
 int Sysctl(const char* name, void* buffer, size_t* size) {
   if (!name || !buffer || !size) return Fail(EINVAL);
+  if (std::string_view(name) == "kern.next_ecc_event") {
+    bool handled = false;
+    const int rc = NextEccEvent(buffer, size, &handled);
+    if (handled) return rc;
+  }
   const cf::Value v = ReadProfileEntry("/device/sysctl.plist", name);
   if (const cf::Number* n = v.AsNumber()) {
     const uint64_t value = n->AsUInt64();

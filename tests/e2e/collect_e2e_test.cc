@@ -1,0 +1,75 @@
+// The daily collection's own keys and records through whole runs: disk
+// usage and the kernel's ECC events.
+#include "../test_values.h"
+#include "root_fixture.h"
+
+namespace {
+
+class CollectRun : public RootTest {
+ protected:
+  std::string Scalar(const std::string& key) {
+    const RunResult dump = RunProgram(TALLYBOOK_BIN, {"dump", "--day", std::to_string(kToday), "--prefix", key}, env);
+    const size_t at = dump.out.find(key + " ");
+    return at == std::string::npos ? "(missing)" : dump.out.substr(at + key.size() + 1, dump.out.find('\n', at) - at - key.size() - 1);
+  }
+  std::vector<cf::Dictionary> EccRecords() {
+    std::vector<cf::Dictionary> out;
+    const std::string text = platform::ReadFile(root / "var/faultkeep/structured_2026-11-22.jsonl").value_or("");
+    for (size_t start = 0; start < text.size();) {
+      const size_t end = text.find('\n', start);
+      const cf::Value line = cf::ParseJSON(text.substr(start, end - start)).value;
+      start = end + 1;
+      if (line.AsDictionary() && line.AsDictionary()->Get("type") == cf::Value::SInt32(172))
+        out.push_back(*line.AsDictionary()->Get("record").AsDictionary());
+    }
+    return out;
+  }
+};
+
+TEST_F(CollectRun, DiskUsageInMiB) {
+  WritePlist("device/answers.plist",
+             Dict({{"DiskUsage", Dict({{"TotalDiskCapacity", cf::Value::SInt64(64000000000)}})}}));
+  Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.homedeck.DiskUsageUserTotalBlocks"), "61035");
+  EXPECT_EQ(Scalar("com.velmora.homedeck.DiskUsageUserBlocksFree"), "-1");  // the entry is missing
+  WritePlist("device/answers.plist", Dict({{"DiskUsage", cf::Value::Bool(false)}}));
+  Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.homedeck.DiskUsageUserTotalBlocks"), "-1");
+  // No entry at all: the root's own filesystem.
+  WritePlist("device/answers.plist", cf::Dictionary());
+  Tallyrun({"-f"});
+  EXPECT_GT(std::stoll(Scalar("com.velmora.homedeck.DiskUsageUserTotalBlocks")), 0);
+}
+
+TEST_F(CollectRun, EccEventsTenARunEachReadOnce) {
+  cf::Array queue;
+  for (int i = 1; i <= 12; ++i)
+    queue.Append(Dict({{"id", cf::Value::SInt32(i)},
+                       {"count", cf::Value::SInt32(i == 1 ? 0 : 2)},
+                       {"reg", cf::Array({cf::Value::SInt64(-i), cf::Value::SInt64(int64_t{1} << 40)})}}));
+  WritePlist("device/ecc-events.plist", queue);
+  RunResult r = Tallyrun({"-f"});
+  auto records = EccRecords();
+  ASSERT_EQ(records.size(), 10u) << r.err;
+  EXPECT_EQ(cf::Value(records[0]), cf::Value(Dict({{"id", cf::Value::SInt32(1)}, {"count", cf::Value::SInt32(0)}})));
+  EXPECT_EQ(cf::Value(records[1]), cf::Value(Dict({{"id", cf::Value::SInt32(2)},
+                                                   {"count", cf::Value::SInt32(2)},
+                                                   {"reg0", cf::Value::SInt64(-2)},
+                                                   {"reg1", cf::Value::SInt64(int64_t{1} << 40)}})));
+  EXPECT_EQ(Count(r.err, "Unexpected errno"), 0u);
+  // The read after the tenth took the eleventh; the next run logs the twelfth.
+  r = Tallyrun({"-f"});
+  records = EccRecords();
+  ASSERT_EQ(records.size(), 11u);
+  EXPECT_EQ(records.back().Get("id"), cf::Value::SInt32(12));
+
+  // An unexpected failure is logged once; an empty queue is silent.
+  WritePlist("device/ecc-events.plist", cf::Array({Dict({{"errno", cf::Value::SInt32(5)}})}));
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "<default>: Unexpected errno (5) reading ECC events from kernel\n"), 1u);
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "Unexpected errno"), 0u);
+  EXPECT_EQ(EccRecords().size(), 11u);
+}
+
+}  // namespace
