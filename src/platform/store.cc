@@ -7,6 +7,7 @@
 #include <thread>
 #include <ctime>
 
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/files.h"
@@ -131,7 +132,19 @@ bool TallyStore::EnableWriteAheadLog() {
 
 bool TallyStore::Fail(const char* what) {
   last_error_ = std::string(what) + ": " + sqlite3_errmsg(db_);
+  bad_input_ = false;
   return false;
+}
+
+bool TallyStore::BadInput(std::string why) {
+  last_error_ = std::move(why);
+  bad_input_ = true;
+  return false;
+}
+
+bool TallyStore::CheckKey(std::string_view key) {
+  std::string why;
+  return cf::IsPropertyListString(key, &why) || BadInput("key cannot be stored, a property list cannot carry it: " + why);
 }
 
 bool TallyStore::Exec(const char* sql) {
@@ -164,6 +177,7 @@ bool TallyStore::InTransaction(const std::function<bool()>& body) {
 bool TallyStore::Batch(const std::function<bool()>& body) { return InTransaction(body); }
 
 bool TallyStore::WriteScalar(const char* sql, const char* what, int32_t day, std::string_view key, int64_t value) {
+  if (!CheckKey(key)) return false;
   Statement st(db_, sql);
   if (!st) return Fail(what);
   sqlite3_bind_int(st.get(), 1, day);
@@ -188,6 +202,7 @@ bool TallyStore::AddScalar(int32_t day, std::string_view key, int64_t value) {
 
 bool TallyStore::PushSamples(int32_t day, std::string_view key,
                              const std::vector<std::pair<double, int32_t>>& samples) {
+  if (!CheckKey(key)) return false;
   return InTransaction([&] {
     Statement series(db_, "INSERT INTO series(day, key) VALUES(?1, ?2) ON CONFLICT(day, key) DO UPDATE SET day = day "
                           "RETURNING id");

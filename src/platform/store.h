@@ -32,6 +32,8 @@ class TallyStore {
   static std::unique_ptr<TallyStore> Open(const std::string& path, Mode mode, std::string* error);
   ~TallyStore();
 
+  // Writes refuse a key that a property list cannot carry (cf::IsPropertyListString):
+  // one such key would keep the whole day's log from being written.
   bool SetScalar(int32_t day, std::string_view key, int64_t value);
   bool AddScalar(int32_t day, std::string_view key, int64_t value);
   bool PushSample(int32_t day, std::string_view key, double value, int32_t seconds_in_day);
@@ -41,6 +43,9 @@ class TallyStore {
   bool Batch(const std::function<bool()>& body);
   bool Checkpoint();
   const std::string& last_error() const { return last_error_; }
+  // Whether the last failure was the caller's input (a bad key, an overflowing
+  // sum) rather than the store itself.
+  bool last_error_is_bad_input() const { return bad_input_; }
   const std::string& path() const { return path_; }
   sqlite3* handle() { return db_; }
 
@@ -50,11 +55,14 @@ class TallyStore {
   bool WriteScalar(const char* sql, const char* what, int32_t day, std::string_view key, int64_t value);
   bool EnableWriteAheadLog();
   bool Fail(const char* what);
+  bool BadInput(std::string why);
+  bool CheckKey(std::string_view key);
   bool InTransaction(const std::function<bool()>& body);
 
   sqlite3* db_;
   std::string path_;
   std::string last_error_;
+  bool bad_input_ = false;
   int batch_depth_ = 0;
 };
 

@@ -220,5 +220,35 @@ TEST(StoreTest, ClientCallsWriteTodayUnderTheRoot) {
   EXPECT_EQ(*ReadFile(bad / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb"), "garbage");
 }
 
+TEST(StoreTest, WritesRefuseKeysALogCannotCarry) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{std::make_shared<FixedClock>(86400.0 * 20000), log});
+  TallyStore& store = *Context::Current().store();
+  const std::string bad_keys[] = {"com.x.bad\x01key", "com.x.\xff", "com.x.\xef\xbf\xbe", std::string("nul\0", 4)};
+  for (const std::string& key : bad_keys) {
+    EXPECT_FALSE(store.SetScalar(1, key, 1));
+    EXPECT_TRUE(store.last_error_is_bad_input());
+    EXPECT_FALSE(store.AddScalar(1, key, 1));
+    EXPECT_FALSE(store.PushSample(1, key, 1, 0));
+    EXPECT_FALSE(store.PushSamples(1, key, {{1, 0}, {2, 0}}));
+    EXPECT_FALSE(TBClientSetValueForScalarKey(key, 1));
+    EXPECT_FALSE(TBClientAddValueForScalarKey(key, 1));
+    EXPECT_FALSE(TBClientPushValueForDistributionKey(key, 1, 0));
+  }
+  EXPECT_EQ(store.last_error(), "key cannot be stored, a property list cannot carry it: control character U+0000 at byte 3");
+  EXPECT_EQ(log->Count("Tallybook set failed: key cannot be stored, a property list cannot carry it: control "
+                       "character U+0001 at byte 9"),
+            1u);
+  EXPECT_EQ(log->CountContaining("Tallybook push failed: key cannot be stored"), 4u);
+  auto history = TBHistory::initWithDefaultPath();
+  ASSERT_NE(history, nullptr);
+  EXPECT_TRUE(Scalars(*history, "", INT32_MIN, INT32_MAX).empty());
+  int series = 0;
+  history->distributionsForKeyPrefix("", INT32_MIN, INT32_MAX,
+                                     [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++series; });
+  EXPECT_EQ(series, 0);
+}
+
 }  // namespace
 }  // namespace platform

@@ -9,6 +9,7 @@
 #include <string>
 
 #include "tools/cli.h"
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/history.h"
@@ -126,6 +127,8 @@ int main(int argc, char** argv) {
   // Writes: every argument is checked before the store is opened, so bad
   // input never touches it.
   if (key.empty()) return BadInput("key must not be empty");
+  if (std::string why; !cf::IsPropertyListString(key, &why))
+    return BadInput("key cannot be stored, a property list cannot carry it: " + why);
   const int32_t today_number = TBDaysSince1970();
   if (push->parsed()) {
     double value = 0;

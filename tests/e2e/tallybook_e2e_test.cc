@@ -58,6 +58,10 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
       {},
       {"set", "k"},
       {"dump", "--day", "99999999999"},
+      // Keys the day's log could not carry.
+      {"set", "com.x.bad\x01key", "5"},
+      {"add", "com.x.\xff", "1"},
+      {"push", "com.x.\xef\xbf\xbf", "1"},
   };
   for (const auto& args : bad) {
     const RunResult r = Tallybook(args);
@@ -69,6 +73,8 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
   }
   EXPECT_EQ(Tallybook({"set", "k", "x"}).err, "tallybook: value is not a signed 64-bit integer: \"x\"\n");
   EXPECT_EQ(Tallybook({"add", "", "1"}).err, "tallybook: key must not be empty\n");
+  EXPECT_EQ(Tallybook({"set", "com.x.bad\x01key", "5"}).err,
+            "tallybook: key cannot be stored, a property list cannot carry it: control character U+0001 at byte 9\n");
 
   // A file that is not a store: clear message, status 1, file untouched.
   ASSERT_TRUE(platform::WriteFileAtomically(root / kStore, "plain text, not a database"));
