@@ -4,6 +4,7 @@
 #include <cmath>
 #include <limits>
 
+#include "cf/plist.h"
 #include "platform/analytics.h"
 #include "platform/context.h"
 #include "platform/faultkeep.h"
@@ -117,12 +118,16 @@ void TBReport::addInstalledAppInfo() {
 }
 
 void TBReport::addMetadataKeys() {
+  // The languages and region come from the environment and the device files:
+  // text the log cannot carry counts as unknown rather than costing the log.
+  auto carried = [](const cf::Value& v) { return v.AsString() && cf::IsPropertyListString(*v.AsString()); };
   const cf::Array preferred = preferredLanguages();
   const cf::Array best = preferredLocalizationsFromArray(systemLanguages(), preferred);
-  _metadataOutput.Set("TBUserInterfaceLanguage", best.empty() ? cf::Value("<unknown>") : best[0]);
-  _metadataOutput.Set("TBPreferredUserInterfaceLanguage", preferred.empty() ? cf::Value("<unknown>") : preferred[0]);
+  _metadataOutput.Set("TBUserInterfaceLanguage", !best.empty() && carried(best[0]) ? best[0] : cf::Value("<unknown>"));
+  _metadataOutput.Set("TBPreferredUserInterfaceLanguage",
+                      !preferred.empty() && carried(preferred[0]) ? preferred[0] : cf::Value("<unknown>"));
   const cf::Value country = CurrentLocaleCountryCode();
-  if (!country.IsNull()) _metadataOutput.Set("TBUserSetRegionFormat", country);
+  if (carried(country)) _metadataOutput.Set("TBUserSetRegionFormat", country);
 }
 
 void TBReport::reportDatabaseSize() {

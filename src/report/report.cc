@@ -11,6 +11,19 @@
 using platform::LogError;
 using platform::LogInfo;
 
+namespace {
+
+// A key the log could not carry would cost the whole day's log; writers
+// refuse such keys, but a store may hold older ones.
+bool Carried(const std::string& key) {
+  std::string why;
+  if (cf::IsPropertyListString(key, &why)) return true;
+  LogError("Skipping a store key that a property list cannot carry: %s", why);
+  return false;
+}
+
+}  // namespace
+
 TBReport::TBReport() : _config(TBConfig::init()) {}
 
 void TBReport::writeLogForYesterday(int32_t day, const cf::Value& appInfo) {
@@ -24,14 +37,15 @@ void TBReport::writeLogForYesterday(int32_t day, const cf::Value& appInfo) {
       // The row's day is not looked at: a key returned twice keeps the later row.
       history->scalarsForKeyPrefix("", day - 1, day, [&](const std::string& key, int32_t, int64_t value, bool*) {
         if (!_config) return;
-        if (auto options = _config->configOptionsForScalarKey(key)) addScalar(value, key, *options);
+        const auto options = _config->configOptionsForScalarKey(key);
+        if (options && Carried(key)) addScalar(value, key, *options);
       });
       history->distributionsForKeyPrefix(
           "", day - 1, day,
           [&](const std::string& key, int32_t, platform::TBHistoryDistributionEnumerator& samples, bool*) {
             if (!_config) return;
-            if (auto options = _config->configOptionsForDistributionKey(key))
-              computeAndAddDistribution(samples, key, *options);
+            const auto options = _config->configOptionsForDistributionKey(key);
+            if (options && Carried(key)) computeAndAddDistribution(samples, key, *options);
           });
     }
   }
