@@ -23,6 +23,10 @@ namespace platform {
 
 inline constexpr const char* kStoreDevicePath = "/var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
 inline constexpr int kStoreSchemaVersion = 1;
+// Where the store's components count the corruptions they meet; the report
+// reads the count and sets it back to 0.
+inline constexpr const char* kStoreCorruptionDomain = "com.velmora.tallybookd";
+inline constexpr const char* kStoreCorruptionKey = "DatabaseCorruptionCount";
 
 class TallyStore {
  public:

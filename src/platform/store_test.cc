@@ -7,12 +7,15 @@
 
 #include <vector>
 
+#include "../../tests/store_pages.h"
 #include "../../tests/temp_dir.h"
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/history.h"
 #include "platform/log.h"
+#include "platform/prefs.h"
 
 namespace platform {
 namespace {
@@ -248,6 +251,56 @@ TEST(StoreTest, WritesRefuseKeysALogCannotCarry) {
   history->distributionsForKeyPrefix("", INT32_MIN, INT32_MAX,
                                      [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++series; });
   EXPECT_EQ(series, 0);
+}
+
+TEST(StoreTest, ACorruptPageIsAReadErrorAndIsCounted) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{std::make_shared<FixedClock>(86400.0 * 20000), log});
+  const std::string path = Context::Current().Path(kStoreDevicePath);
+  constexpr int kKeys = 3000, kSeries = 300, kSamples = 40;
+  {
+    auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+    ASSERT_NE(store, nullptr);
+    ASSERT_TRUE(store->Batch([&] {
+      bool ok = true;
+      for (int i = 0; i < kKeys; ++i) ok = ok && store->SetScalar(11, "com.velmora.k" + std::to_string(10000 + i), i);
+      std::vector<std::pair<double, int32_t>> samples(kSamples, {1.5, 60});
+      for (int i = 0; i < kSeries; ++i) ok = ok && store->PushSamples(11, "com.velmora.d" + std::to_string(i), samples);
+      return ok;
+    }));
+  }  // the last connection folds the log into the file
+  int64_t page_size = 0;
+  const std::vector<int64_t> scalar_leaves = LeafPages(path, "scalars", &page_size);
+  const std::vector<int64_t> sample_leaves = LeafPages(path, "samples", &page_size);
+  ASSERT_GT(scalar_leaves.size(), 4u);
+  ASSERT_GT(sample_leaves.size(), 4u);
+  ASSERT_TRUE(OverwritePage(path, scalar_leaves[scalar_leaves.size() / 2], page_size));
+
+  auto history = TBHistory::initWithDefaultPath();
+  ASSERT_NE(history, nullptr);
+  int rows = 0;
+  EXPECT_FALSE(history->scalarsForKeyPrefix("", 10, 11, [&](const std::string&, int32_t, int64_t, bool*) { ++rows; }));
+  EXPECT_GT(rows, 0);
+  EXPECT_LT(rows, kKeys);
+  EXPECT_EQ(log->Count("Tallybook history read failed: database disk image is malformed"), 1u);
+  EXPECT_EQ(DGVPreferencesGetIntegerValue(kStoreCorruptionKey, kStoreCorruptionDomain), 1);
+
+  // Samples cut short by a bad page are a failure too, not a shorter day.
+  ASSERT_TRUE(OverwritePage(path, sample_leaves[sample_leaves.size() / 2], page_size));
+  history = TBHistory::initWithDefaultPath();
+  int samples = 0;
+  EXPECT_FALSE(history->distributionsForKeyPrefix(
+      "", 10, 11, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
+        while (e.getNextValue(nullptr, nullptr)) ++samples;
+      }));
+  EXPECT_LT(samples, kSeries * kSamples);
+  EXPECT_EQ(log->Count("Tallybook history read failed: database disk image is malformed"), 2u);
+  // Counted on disk at once, where the report's support library reads it.
+  const cf::Value on_disk =
+      cf::ParsePropertyList(ReadFile(root / "Library/Preferences/com.velmora.tallybookd.plist").value_or("")).value;
+  ASSERT_NE(on_disk.AsDictionary(), nullptr);
+  EXPECT_EQ(on_disk.AsDictionary()->Get("DatabaseCorruptionCount"), cf::Value::SInt64(2));
 }
 
 }  // namespace

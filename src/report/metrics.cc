@@ -11,6 +11,7 @@
 #include "platform/files.h"
 #include "platform/loader.h"
 #include "platform/log.h"
+#include "platform/store.h"
 #include "platform/system.h"
 #include "report/report.h"
 
@@ -87,9 +88,9 @@ bool ResolveSupportFunctions(SupportFunctions& f) {
 int64_t ReadAndResetCorruptionCount() {
   static SupportFunctions functions;
   if (!ResolveSupportFunctions(functions)) return 0;
-  const int64_t count = functions.get("DatabaseCorruptionCount", "com.velmora.tallybookd", nullptr);
+  const int64_t count = functions.get(platform::kStoreCorruptionKey, platform::kStoreCorruptionDomain, nullptr);
   const cf::Value zero = cf::Value::SInt64(0);
-  functions.set("DatabaseCorruptionCount", &zero, "com.velmora.tallybookd");
+  functions.set(platform::kStoreCorruptionKey, &zero, platform::kStoreCorruptionDomain);
   return count;
 }
 

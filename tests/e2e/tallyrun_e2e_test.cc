@@ -5,6 +5,7 @@
 #include <set>
 #include <thread>
 
+#include "../store_pages.h"
 #include "root_fixture.h"
 
 namespace {
@@ -342,6 +343,39 @@ TEST_F(TallyrunTest, OneBadValueNeverCostsTheDay) {
   ASSERT_NE(info.AsArray(), nullptr);
   ASSERT_EQ(info.AsArray()->size(), 1u);
   EXPECT_EQ(info.AsArray()->at(0).AsDictionary()->Get("bundle"), cf::Value("com.example.maps"));
+}
+
+TEST_F(TallyrunTest, ACorruptStoreWithholdsTheLogAndIsCounted) {
+  // A busy day: enough listed keys for the scalars to span many pages.
+  std::string sql = "BEGIN;";
+  for (int i = 0; i < 2000; ++i)
+    sql += "INSERT INTO scalars VALUES(20778, 'com.velmora.wifi.Filler" + std::to_string(10000 + i) + "', " +
+           std::to_string(i) + ");";
+  StoreSQL(root.path(), sql + "COMMIT;");
+  const std::string store = root / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
+  int64_t page_size = 0;
+  const std::vector<int64_t> leaves = LeafPages(store, "scalars", &page_size);
+  ASSERT_GT(leaves.size(), 10u);
+  // Yesterday's rows come first in key order and fill nearly every leaf.
+  ASSERT_TRUE(OverwritePage(store, leaves[leaves.size() / 2], page_size));
+
+  RunResult r = Tallyrun({"-d"});
+  EXPECT_TRUE(Logs().empty());
+  EXPECT_EQ(Count(r.err, "<error>: Tallybook history read failed: database disk image is malformed\n"), 1u) << r.err;
+  EXPECT_EQ(Count(r.err, "<error>: Not writing the aggregated log for day 20778: the store could not be read "
+                         "completely\n"),
+            1u);
+  const cf::Value counter = ReadPlist(root / "Library/Preferences/com.velmora.tallybookd.plist");
+  ASSERT_NE(counter.AsDictionary(), nullptr);
+  EXPECT_EQ(counter.AsDictionary()->Get("DatabaseCorruptionCount"), cf::Value::SInt64(1));
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));  // the day counts as handled
+
+  // The next day's log, read from pages the damage did not reach, reports it.
+  env["TALLYRUN_NOW"] = "2026-11-23T15:00:00Z";
+  r = Tallyrun({"-d"});
+  ASSERT_EQ(Logs().size(), 1u) << r.err;
+  EXPECT_EQ(LastLog().Get("TBScalars").AsDictionary()->Get("com.velmora.diagvault.tbkd.database.corruptions"),
+            cf::Value::SInt64(1));
 }
 
 TEST_F(TallyrunTest, ToolsRefuseBadInput) {
