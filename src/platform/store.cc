@@ -194,10 +194,18 @@ bool TallyStore::SetScalar(int32_t day, std::string_view key, int64_t value) {
 
 bool TallyStore::AddScalar(int32_t day, std::string_view key, int64_t value) {
   // One statement: the read and the write happen under the same write lock,
-  // so concurrent adders never lose each other's increments.
-  return WriteScalar("INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
-                     "ON CONFLICT(day, key) DO UPDATE SET value = value + excluded.value",
-                     "add scalar", day, key, value);
+  // so concurrent adders never lose each other's increments. SQLite would
+  // turn an overflowing sum into a real that then sticks, so a sum past the
+  // range leaves the row alone, and no change at all tells us so.
+  if (!WriteScalar("INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
+                   "ON CONFLICT(day, key) DO UPDATE SET value = value + excluded.value "
+                   "WHERE (excluded.value >= 0 AND value <= 9223372036854775807 - excluded.value) "
+                   "OR (excluded.value < 0 AND value >= -9223372036854775807 - 1 - excluded.value)",
+                   "add scalar", day, key, value))
+    return false;
+  if (sqlite3_changes(db_) > 0) return true;
+  return BadInput("adding " + std::to_string(value) + " to " + std::string(key) +
+                  " would take its value past the signed 64-bit range");
 }
 
 bool TallyStore::PushSamples(int32_t day, std::string_view key,

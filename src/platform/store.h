@@ -39,6 +39,7 @@ class TallyStore {
   // Writes refuse a key that a property list cannot carry (cf::IsPropertyListString):
   // one such key would keep the whole day's log from being written.
   bool SetScalar(int32_t day, std::string_view key, int64_t value);
+  // Refuses a sum past the signed 64-bit range and leaves the value as it was.
   bool AddScalar(int32_t day, std::string_view key, int64_t value);
   bool PushSample(int32_t day, std::string_view key, double value, int32_t seconds_in_day);
   // Many samples of one key in one transaction (tools and benchmarks).

@@ -5,6 +5,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdint>
 #include <vector>
 
 #include "../../tests/store_pages.h"
@@ -223,6 +224,21 @@ TEST(StoreTest, ClientCallsWriteTodayUnderTheRoot) {
   EXPECT_EQ(*ReadFile(bad / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb"), "garbage");
 }
 
+// The stored value and its SQLite type, straight from the table.
+std::string Stored(TallyStore& store, int32_t day, const std::string& key) {
+  sqlite3_stmt* st = nullptr;
+  sqlite3_prepare_v2(store.handle(), "SELECT typeof(value), value FROM scalars WHERE day = ?1 AND key = ?2", -1, &st,
+                     nullptr);
+  sqlite3_bind_int(st, 1, day);
+  sqlite3_bind_text(st, 2, key.c_str(), -1, SQLITE_TRANSIENT);
+  std::string out = "none";
+  if (sqlite3_step(st) == SQLITE_ROW)
+    out = std::string(reinterpret_cast<const char*>(sqlite3_column_text(st, 0))) + " " +
+          reinterpret_cast<const char*>(sqlite3_column_text(st, 1));
+  sqlite3_finalize(st);
+  return out;
+}
+
 TEST(StoreTest, WritesRefuseKeysALogCannotCarry) {
   TempDir root;
   auto log = std::make_shared<CaptureLog>();
@@ -251,6 +267,40 @@ TEST(StoreTest, WritesRefuseKeysALogCannotCarry) {
   history->distributionsForKeyPrefix("", INT32_MIN, INT32_MAX,
                                      [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++series; });
   EXPECT_EQ(series, 0);
+}
+
+TEST(StoreTest, AddingPastTheRangeIsRefused) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{std::make_shared<FixedClock>(86400.0 * 20000), log});
+  TallyStore& store = *Context::Current().store();
+  // Sums at both ends of the range: one past is refused and leaves an
+  // integer behind, never a real.
+  struct Sum {
+    int64_t start, add;
+    bool ok;
+    int64_t end;
+  };
+  const Sum sums[] = {
+      {INT64_MAX - 1, 1, true, INT64_MAX}, {INT64_MAX, 1, false, INT64_MAX}, {INT64_MAX, INT64_MIN, true, -1},
+      {1, INT64_MAX, false, 1},            {INT64_MIN + 1, -1, true, INT64_MIN}, {INT64_MIN, -1, false, INT64_MIN},
+      {-1, INT64_MIN, false, -1},          {0, INT64_MIN, true, INT64_MIN},      {INT64_MIN, INT64_MAX, true, -1},
+  };
+  for (size_t i = 0; i < std::size(sums); ++i) {
+    const std::string key = "sum." + std::to_string(i);
+    ASSERT_TRUE(store.SetScalar(2, key, sums[i].start));
+    EXPECT_EQ(store.AddScalar(2, key, sums[i].add), sums[i].ok) << key;
+    EXPECT_TRUE(sums[i].ok || store.last_error_is_bad_input()) << key;
+    EXPECT_EQ(Stored(store, 2, key), "integer " + std::to_string(sums[i].end)) << key;
+  }
+  EXPECT_EQ(store.last_error(), "adding -9223372036854775808 to sum.6 would take its value past the signed 64-bit range");
+  EXPECT_TRUE(store.AddScalar(2, "sum.new", INT64_MIN));  // a new row takes any value
+  EXPECT_EQ(Stored(store, 2, "sum.new"), "integer -9223372036854775808");
+  ASSERT_TRUE(TBClientSetValueForScalarKey("sum.client", INT64_MAX));
+  EXPECT_FALSE(TBClientAddValueForScalarKey("sum.client", 1));
+  EXPECT_EQ(log->Count("Tallybook add failed: adding 1 to sum.client would take its value past the signed 64-bit "
+                       "range"),
+            1u);
 }
 
 TEST(StoreTest, ACorruptPageIsAReadErrorAndIsCounted) {

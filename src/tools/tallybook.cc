@@ -153,7 +153,7 @@ int main(int argc, char** argv) {
   const bool ok = set->parsed() ? store->SetScalar(today_number, key, value) : store->AddScalar(today_number, key, value);
   if (!ok) {
     std::fprintf(stderr, "tallybook: %s\n", store->last_error().c_str());
-    return kStoreError;
+    return store->last_error_is_bad_input() ? kBadInput : kStoreError;
   }
   (void)add;
   return 0;

@@ -48,6 +48,7 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
       {"set", "", "1"},
       {"set", "k", "1.5"},
       {"set", "k", "9223372036854775808"},
+      {"set", "k", "-9223372036854775809"},
       {"add", "k", "twelve"},
       {"add", "k", ""},
       {"push", "k", "nan"},
@@ -83,6 +84,33 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
   EXPECT_NE(r.err.find("is not a Tallybook store"), std::string::npos) << r.err;
   EXPECT_EQ(*platform::ReadFile(root / kStore), "plain text, not a database");
   EXPECT_EQ(Tallybook({"dump"}).status, 1);
+}
+
+TEST_F(TallybookTest, ValuesAtTheEdgesOfTheRange) {
+  EXPECT_EQ(Tallybook({"set", "com.velmora.max", "9223372036854775807"}).status, 0);
+  EXPECT_EQ(Tallybook({"set", "com.velmora.min", "-9223372036854775808"}).status, 0);
+  EXPECT_EQ(Tallybook({"set", "com.velmora.near", "9223372036854775806"}).status, 0);
+  EXPECT_EQ(Tallybook({"add", "com.velmora.near", "1"}).status, 0);
+  const std::string before = Tallybook({"dump"}).out;
+  EXPECT_EQ(before,
+            "20779 com.velmora.max 9223372036854775807\n"
+            "20779 com.velmora.min -9223372036854775808\n"
+            "20779 com.velmora.near 9223372036854775807\n");
+
+  // One past either end is refused, and the value stays an integer.
+  RunResult r = Tallybook({"add", "com.velmora.max", "1"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_EQ(r.err,
+            "tallybook: adding 1 to com.velmora.max would take its value past the signed 64-bit range\n");
+  r = Tallybook({"add", "com.velmora.min", "-1"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_EQ(r.err,
+            "tallybook: adding -1 to com.velmora.min would take its value past the signed 64-bit range\n");
+  EXPECT_EQ(Tallybook({"add", "com.velmora.near", "9223372036854775807"}).status, 2);
+  EXPECT_EQ(Tallybook({"set", "com.velmora.max", "9223372036854775808"}).status, 2);
+  EXPECT_EQ(Tallybook({"dump"}).out, before);
+  EXPECT_EQ(Tallybook({"add", "com.velmora.max", "-9223372036854775808"}).status, 0);
+  EXPECT_EQ(Tallybook({"dump", "--prefix", "com.velmora.max"}).out, "20779 com.velmora.max -1\n");
 }
 
 TEST_F(TallybookTest, ParallelProcessesAddExactly) {
