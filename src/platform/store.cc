@@ -246,10 +246,18 @@ bool TallyStore::PushSample(int32_t day, std::string_view key, double value, int
 }
 
 bool TallyStore::Checkpoint() {
-  int log_frames = 0, checkpointed = 0;
-  if (sqlite3_wal_checkpoint_v2(db_, nullptr, SQLITE_CHECKPOINT_PASSIVE, &log_frames, &checkpointed) != SQLITE_OK)
-    return Fail("checkpoint");
-  return true;
+  // A passive checkpoint never calls the busy handler: while another
+  // connection checkpoints (a writer's automatic one, say) it fails at once
+  // with "database is locked". Wait for it as the busy timeout would.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kBusyTimeoutMs);
+  for (int attempt = 0;; ++attempt) {
+    int log_frames = 0, checkpointed = 0;
+    const int rc = sqlite3_wal_checkpoint_v2(db_, nullptr, SQLITE_CHECKPOINT_PASSIVE, &log_frames, &checkpointed);
+    if (rc == SQLITE_OK) return true;
+    if ((rc != SQLITE_BUSY && rc != SQLITE_LOCKED) || std::chrono::steady_clock::now() > deadline)
+      return Fail("checkpoint");
+    std::this_thread::sleep_for(std::chrono::milliseconds(1 + attempt % 10));
+  }
 }
 
 int32_t DaysSince1970At(double t) {

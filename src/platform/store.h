@@ -46,6 +46,7 @@ class TallyStore {
   bool PushSamples(int32_t day, std::string_view key, const std::vector<std::pair<double, int32_t>>& samples);
   // Many operations in one transaction; the body's writes use the methods above.
   bool Batch(const std::function<bool()>& body);
+  // Waits (up to the busy timeout) for a concurrent writer or checkpointer.
   bool Checkpoint();
   const std::string& last_error() const { return last_error_; }
   // Whether the last failure was the caller's input (a bad key, an overflowing

@@ -5,7 +5,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstdint>
+#include <thread>
 #include <vector>
 
 #include "../../tests/store_pages.h"
@@ -301,6 +303,53 @@ TEST(StoreTest, AddingPastTheRangeIsRefused) {
   EXPECT_EQ(log->Count("Tallybook add failed: adding 1 to sum.client would take its value past the signed 64-bit "
                        "range"),
             1u);
+}
+
+TEST(StoreTest, CheckpointWaitsForAnotherConnectionsCheckpoint) {
+  TempDir dir;
+  const std::string path = dir / "s.sqlitedb";
+  auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+  ASSERT_NE(store, nullptr);
+  ASSERT_TRUE(store->SetScalar(1, "k", 1));
+
+  // A writer holds the write lock; a second connection starts a full
+  // checkpoint, which takes the checkpoint lock and then waits for the
+  // writer. Our checkpoint meets that lock.
+  sqlite3* writer = nullptr;
+  sqlite3* checkpointer = nullptr;
+  ASSERT_EQ(sqlite3_open(path.c_str(), &writer), SQLITE_OK);
+  ASSERT_EQ(sqlite3_open(path.c_str(), &checkpointer), SQLITE_OK);
+  // A connection joins the write-ahead log only once it has read.
+  ASSERT_EQ(sqlite3_exec(checkpointer, "SELECT count(*) FROM scalars", nullptr, nullptr, nullptr), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(writer, "BEGIN IMMEDIATE; INSERT INTO scalars VALUES(1, 'w', 1)", nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  std::atomic<bool> waiting{false}, release{false};
+  sqlite3_busy_handler(
+      checkpointer,
+      [](void* flag, int) {
+        static_cast<std::atomic<bool>*>(flag)->store(true);
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+        return 1;
+      },
+      &waiting);
+  int checkpointer_rc = -1;
+  std::thread full([&] {
+    checkpointer_rc = sqlite3_wal_checkpoint_v2(checkpointer, nullptr, SQLITE_CHECKPOINT_FULL, nullptr, nullptr);
+  });
+  std::thread commit([&] {
+    while (!release) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));  // while our checkpoint is under way
+    sqlite3_exec(writer, "COMMIT", nullptr, nullptr, nullptr);
+  });
+  for (int i = 0; i < 10000 && !waiting; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  EXPECT_TRUE(waiting) << "the other checkpoint never waited for the writer";
+  release = true;
+  EXPECT_TRUE(store->Checkpoint()) << store->last_error();
+  commit.join();
+  full.join();
+  EXPECT_EQ(checkpointer_rc, SQLITE_OK);
+  sqlite3_close(writer);
+  sqlite3_close(checkpointer);
 }
 
 TEST(StoreTest, ACorruptPageIsAReadErrorAndIsCounted) {
