@@ -118,6 +118,7 @@ int main(int argc, char** argv) {
     std::printf("%d\n", TBDaysSince1970());
     return 0;
   }
+  if (const auto status = CheckDeviceRoot("tallybook")) return *status;
   if (dump->parsed()) {
     if (day_opt->count() && (day < std::numeric_limits<int32_t>::min() || day > std::numeric_limits<int32_t>::max()))
       return BadInput("day number out of range: " + std::to_string(day));

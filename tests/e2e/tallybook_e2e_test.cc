@@ -2,6 +2,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <filesystem>
+
 #include "../temp_dir.h"
 #include "platform/files.h"
 #include "run.h"
@@ -111,6 +113,38 @@ TEST_F(TallybookTest, ValuesAtTheEdgesOfTheRange) {
   EXPECT_EQ(Tallybook({"dump"}).out, before);
   EXPECT_EQ(Tallybook({"add", "com.velmora.max", "-9223372036854775808"}).status, 0);
   EXPECT_EQ(Tallybook({"dump", "--prefix", "com.velmora.max"}).out, "20779 com.velmora.max -1\n");
+}
+
+TEST_F(TallybookTest, AMissingOrUnreadableRootIsAnError) {
+  const std::string typo = root / "no/such/root";
+  env["TALLYRUN_ROOT"] = typo;
+  for (const auto& args : std::vector<std::vector<std::string>>{{"set", "k", "1"}, {"push", "k", "1"}, {"dump"}}) {
+    const RunResult r = Tallybook(args);
+    EXPECT_EQ(r.status, 1) << args[0];
+    EXPECT_EQ(r.err, "tallybook: no device root at " + typo + " (TALLYRUN_ROOT); make one with: devsim init " + typo +
+                         "\n");
+  }
+  EXPECT_FALSE(platform::FileExists(root / "no"));
+  const RunResult ctl = RunProgram(TALLYCTL_BIN, {"logging-status"}, env);
+  EXPECT_EQ(ctl.status, 1);
+  EXPECT_EQ(ctl.err, "tallyctl: no device root at " + typo + " (TALLYRUN_ROOT); make one with: devsim init " + typo + "\n");
+  ASSERT_TRUE(platform::WriteFileAtomically(root / "file", "x"));
+  env["TALLYRUN_ROOT"] = root / "file";
+  EXPECT_EQ(Tallybook({"set", "k", "1"}).err, "tallybook: the device root " + (root / "file") + " is not a directory\n");
+  EXPECT_EQ(Tallybook({"today"}).status, 0);  // needs no root
+
+  // A root locked against everyone, the superuser included.
+  namespace fs = std::filesystem;
+  env["TALLYRUN_ROOT"] = root.path();
+  fs::permissions(root.path(), fs::perms::none);
+  RunResult r = Tallybook({"set", "k", "3"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: cannot read the device root " + root.path() + ": Permission denied\n");
+  r = RunProgram(TALLYCTL_BIN, {"logging-status"}, env);
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallyctl: cannot read the device root " + root.path() + ": Permission denied\n");
+  fs::permissions(root.path(), fs::perms::owner_all);
+  EXPECT_FALSE(platform::FileExists(root / "var"));
 }
 
 TEST_F(TallybookTest, ParallelProcessesAddExactly) {
