@@ -1,11 +1,15 @@
 #include "platform/store.h"
 
 #include <sqlite3.h>
+#include <unistd.h>
 
+#include <cctype>
+#include <cerrno>
 #include <chrono>
 #include <cmath>
-#include <thread>
+#include <cstring>
 #include <ctime>
+#include <thread>
 
 #include "cf/plist.h"
 #include "platform/clock.h"
@@ -51,6 +55,30 @@ class Statement {
   sqlite3_stmt* stmt_ = nullptr;
 };
 
+std::string Lowered(const char* text) {
+  std::string s = text;
+  if (!s.empty()) s[0] = static_cast<char>(std::tolower(static_cast<unsigned char>(s[0])));
+  return s;
+}
+
+// When SQLite cannot open or read a store, the cause is often access, not
+// content: say so plainly, so that a read-only directory is not taken for a
+// foreign file. Empty when access is not the problem.
+std::string AccessProblem(const std::string& path) {
+  if (access(path.c_str(), R_OK | W_OK) != 0 && errno != ENOENT) {
+    const int cause = errno;
+    return "the file cannot be read and written (" + Lowered(std::strerror(cause)) + ")";
+  }
+  const size_t slash = path.find_last_of('/');
+  const std::string dir = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+  if (access(dir.c_str(), W_OK | X_OK) != 0) {
+    const int cause = errno;
+    return "its directory " + dir + " is not writable (" + Lowered(std::strerror(cause)) +
+           "), and the store keeps its write-ahead log beside it";
+  }
+  return {};
+}
+
 }  // namespace
 
 std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode, std::string* error) {
@@ -60,15 +88,18 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   };
   if (mode == Mode::kCreate) {
     const size_t slash = path.find_last_of('/');
-    if (slash != std::string::npos && slash > 0 && !MakeDirectories(path.substr(0, slash)))
-      return fail("cannot create the directory of " + path);
+    if (slash != std::string::npos && slash > 0 && !MakeDirectories(path.substr(0, slash))) {
+      const int cause = errno;
+      return fail("cannot create the directory of " + path + " (" + Lowered(std::strerror(cause)) + ")");
+    }
   } else if (!FileExists(path)) {
     return fail("no store at " + path);
   }
   sqlite3* db = nullptr;
   const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | (mode == Mode::kCreate ? SQLITE_OPEN_CREATE : 0);
   if (sqlite3_open_v2(path.c_str(), &db, flags, nullptr) != SQLITE_OK) {
-    std::string why = db ? sqlite3_errmsg(db) : "out of memory";
+    std::string why = AccessProblem(path);
+    if (why.empty()) why = db ? sqlite3_errmsg(db) : "out of memory";
     sqlite3_close(db);
     return fail("cannot open store " + path + ": " + why);
   }
@@ -80,8 +111,11 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   int foreign_tables = 0;
   {
     Statement st(db, "SELECT count(*) FROM sqlite_master WHERE type='table' AND name NOT IN ('scalars','series','samples')");
-    if (!st || sqlite3_step(st.get()) != SQLITE_ROW)
+    if (!st || sqlite3_step(st.get()) != SQLITE_ROW) {
+      const std::string why = AccessProblem(path);
+      if (!why.empty()) return fail("cannot open store " + path + ": " + why);
       return fail(path + " is not a Tallybook store (" + sqlite3_errmsg(db) + ")");
+    }
     foreign_tables = sqlite3_column_int(st.get(), 0);
   }
   {
@@ -98,7 +132,10 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   if (version != 0 && version < kStoreSchemaVersion)
     return fail(path + " has unknown store schema version " + std::to_string(version));
 
-  if (!store->EnableWriteAheadLog()) return fail(store->last_error_);
+  if (!store->EnableWriteAheadLog()) {
+    const std::string why = AccessProblem(path);
+    return fail(why.empty() ? store->last_error_ : "cannot open store " + path + ": " + why);
+  }
   store->Exec("PRAGMA synchronous=NORMAL");
   if (version == 0) {
     // Another process may be creating the schema at the same moment: decide

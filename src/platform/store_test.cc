@@ -7,6 +7,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <filesystem>
 #include <thread>
 #include <vector>
 
@@ -400,6 +401,26 @@ TEST(StoreTest, ACorruptPageIsAReadErrorAndIsCounted) {
       cf::ParsePropertyList(ReadFile(root / "Library/Preferences/com.velmora.tallybookd.plist").value_or("")).value;
   ASSERT_NE(on_disk.AsDictionary(), nullptr);
   EXPECT_EQ(on_disk.AsDictionary()->Get("DatabaseCorruptionCount"), cf::Value::SInt64(2));
+}
+
+TEST(StoreTest, AStoreOutOfReachSaysWhy) {
+  if (geteuid() == 0) GTEST_SKIP() << "running as root: file permissions do not apply, so nothing is out of reach";
+  TempDir dir;
+  const std::string path = dir / "ro/s.sqlitedb";
+  ASSERT_NE(TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr), nullptr);
+  namespace fs = std::filesystem;
+  fs::permissions(dir / "ro", fs::perms::owner_read | fs::perms::owner_exec);
+  std::string error;
+  EXPECT_EQ(TallyStore::Open(path, TallyStore::Mode::kExisting, &error), nullptr);
+  EXPECT_EQ(error, "cannot open store " + path + ": its directory " + (dir / "ro") +
+                       " is not writable (permission denied), and the store keeps its write-ahead log beside it");
+  EXPECT_EQ(TallyStore::Open(dir / "ro/new.sqlitedb", TallyStore::Mode::kCreate, &error), nullptr);
+  EXPECT_NE(error.find("is not writable (permission denied)"), std::string::npos) << error;
+
+  fs::permissions(dir / "ro", fs::perms::owner_all);
+  fs::permissions(path, fs::perms::none);
+  EXPECT_EQ(TallyStore::Open(path, TallyStore::Mode::kExisting, &error), nullptr);
+  EXPECT_EQ(error, "cannot open store " + path + ": the file cannot be read and written (permission denied)");
 }
 
 }  // namespace

@@ -6,6 +6,7 @@
 
 #include "../temp_dir.h"
 #include "platform/files.h"
+#include "platform/store.h"
 #include "run.h"
 
 namespace {
@@ -145,6 +146,32 @@ TEST_F(TallybookTest, AMissingOrUnreadableRootIsAnError) {
   EXPECT_EQ(r.err, "tallyctl: cannot read the device root " + root.path() + ": Permission denied\n");
   fs::permissions(root.path(), fs::perms::owner_all);
   EXPECT_FALSE(platform::FileExists(root / "var"));
+}
+
+TEST_F(TallybookTest, ARootOrStoreOutOfReachSaysWhy) {
+  if (geteuid() == 0) GTEST_SKIP() << "running as root: file permissions do not apply, so nothing is out of reach";
+  namespace fs = std::filesystem;
+  {
+    // Closed as the daily job closes it: no log files are left beside it.
+    auto store = platform::TallyStore::Open(root / kStore, platform::TallyStore::Mode::kCreate, nullptr);
+    ASSERT_TRUE(store && store->SetScalar(20779, "k", 1));
+  }
+  const std::string dir = root / "var/mobile/Library/Tallybook";
+  fs::permissions(dir, fs::perms::owner_read | fs::perms::owner_exec);
+  RunResult r = Tallybook({"set", "k", "2"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: cannot open store " + (root / kStore) + ": its directory " + dir +
+                       " is not writable (permission denied), and the store keeps its write-ahead log beside it\n");
+  fs::permissions(dir, fs::perms::owner_all);
+
+  // Readable only by its owner: another user may not use it.
+  fs::permissions(root.path(), fs::perms::owner_write | fs::perms::owner_exec | fs::perms::group_read |
+                                   fs::perms::group_exec | fs::perms::others_read | fs::perms::others_exec);
+  r = Tallybook({"set", "k", "3"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: cannot read the device root " + root.path() + ": Permission denied\n");
+  fs::permissions(root.path(), fs::perms::owner_all);
+  EXPECT_EQ(Tallybook({"dump"}).out, "20779 k 1\n");
 }
 
 TEST_F(TallybookTest, ParallelProcessesAddExactly) {
