@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <charconv>
 #include <cmath>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
@@ -185,6 +186,48 @@ ParseResult ParsePropertyList(std::string_view bytes) {
   return r;
 }
 
+// ---- text a property list can carry ----
+
+bool IsPropertyListString(std::string_view s, std::string* why) {
+  auto fail = [&](const char* what, uint32_t c, size_t at) {
+    if (why) {
+      char buf[80];
+      if (c == UINT32_MAX) std::snprintf(buf, sizeof buf, "%s at byte %zu", what, at);
+      else std::snprintf(buf, sizeof buf, "%s U+%04X at byte %zu", what, static_cast<unsigned>(c), at);
+      *why = buf;
+    }
+    return false;
+  };
+  const auto* p = reinterpret_cast<const unsigned char*>(s.data());
+  const size_t n = s.size();
+  for (size_t i = 0; i < n;) {
+    const unsigned char b = p[i];
+    if (b < 0x80) {
+      if (b < 0x20 && b != '\t' && b != '\n' && b != '\r') return fail("control character", b, i);
+      ++i;
+      continue;
+    }
+    // The shortest form only, no surrogates, nothing past U+10FFFF: the
+    // second byte's range depends on the first.
+    size_t length = 0;
+    unsigned char lo = 0x80, hi = 0xBF;
+    uint32_t c = 0;
+    if (b >= 0xC2 && b <= 0xDF) length = 2, c = b & 0x1F;
+    else if (b >= 0xE0 && b <= 0xEF) length = 3, c = b & 0x0F, lo = b == 0xE0 ? 0xA0 : 0x80, hi = b == 0xED ? 0x9F : 0xBF;
+    else if (b >= 0xF0 && b <= 0xF4) length = 4, c = b & 0x07, lo = b == 0xF0 ? 0x90 : 0x80, hi = b == 0xF4 ? 0x8F : 0xBF;
+    else return fail("invalid UTF-8", UINT32_MAX, i);
+    if (n - i < length) return fail("invalid UTF-8", UINT32_MAX, i);
+    for (size_t k = 1; k < length; ++k) {
+      const unsigned char cont = p[i + k];
+      if (cont < (k == 1 ? lo : 0x80) || cont > (k == 1 ? hi : 0xBF)) return fail("invalid UTF-8", UINT32_MAX, i);
+      c = (c << 6) | (cont & 0x3F);
+    }
+    if (c == 0xFFFE || c == 0xFFFF) return fail("noncharacter", c, i);
+    i += length;
+  }
+  return true;
+}
+
 // ---- XML writer ----
 
 namespace {
@@ -198,12 +241,6 @@ void AppendEscaped(std::string& out, const std::string& s) {
       default: out += c;
     }
   }
-}
-
-bool HasControlCharacters(const std::string& s) {
-  for (unsigned char c : s)
-    if (c < 0x20 && c != '\t' && c != '\n' && c != '\r') return true;
-  return false;
 }
 
 std::string RealText(double d) {
@@ -235,8 +272,8 @@ bool WriteXMLNode(const Value& v, int depth, std::string& out, std::string& erro
       return true;
     }
     case Type::kString:
-      if (HasControlCharacters(*v.AsString())) {
-        error = "string with control characters cannot be written to a property list";
+      if (std::string why; !IsPropertyListString(*v.AsString(), &why)) {
+        error = "string cannot be written to a property list: " + why;
         return false;
       }
       out += "<string>";
@@ -275,8 +312,8 @@ bool WriteXMLNode(const Value& v, int depth, std::string& out, std::string& erro
                   " cannot be written to a property list";
           return false;
         }
-        if (HasControlCharacters(*key)) {
-          error = "key with control characters cannot be written to a property list";
+        if (std::string why; !IsPropertyListString(*key, &why)) {
+          error = "key cannot be written to a property list: " + why;
           return false;
         }
         out += indent + "\t<key>";

@@ -25,9 +25,16 @@ inline constexpr int kMaxNesting = 256;
 // Detects the format from the bytes ("bplist00" starts a binary list).
 ParseResult ParsePropertyList(std::string_view bytes);
 
+// Whether a property list can carry the text: it must be valid UTF-8 and hold
+// none of the characters XML 1.0 forbids (U+0000-U+0008, U+000B, U+000C,
+// U+000E-U+001F, U+FFFE, U+FFFF). Everything that lets outside text into a
+// value bound for the aggregated log or a preference file asks this one
+// question. *why (when given) gets the first fault and its byte offset.
+bool IsPropertyListString(std::string_view s, std::string* why = nullptr);
+
 // An XML property list, version 1.0, tab-indented. Fails (with a reason in
 // *error) for values a property list cannot hold: null, non-string keys,
-// strings with control characters.
+// strings (keys or values) that IsPropertyListString refuses.
 bool WriteXMLPropertyList(const Value& v, std::string& out, std::string* error);
 bool WriteBinaryPropertyList(const Value& v, std::string& out, std::string* error);
 

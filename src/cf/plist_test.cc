@@ -91,6 +91,66 @@ TEST(PlistTest, UnwritableValuesFailWithAReason) {
   EXPECT_NE(out.find("<real>+infinity</real>"), std::string::npos);
 }
 
+TEST(PlistTest, OnlyTextAPropertyListCanCarryIsWritten) {
+  struct Case {
+    std::string text;
+    const char* why;  // nullptr: carried
+  };
+  const Case cases[] = {
+      {"", nullptr},
+      {"tab\tnewline\ncr\r", nullptr},
+      {"del \x7f, C1 \xc2\x80, \xc2\x9f", nullptr},            // XML 1.0 allows them
+      {"\xef\xbf\xbd \xef\xbf\xbc \xee\x80\x80", nullptr},  // U+FFFD, U+FFFC, U+E000
+      {"\xf0\x9f\x98\x80 \xf4\x8f\xbf\xbf \xed\x9f\xbf", nullptr},  // U+1F600, U+10FFFF, U+D7FF
+      {std::string("a\0b", 3), "control character U+0000 at byte 1"},
+      {"com.x.bad\x01key", "control character U+0001 at byte 9"},
+      {"\x08", "control character U+0008 at byte 0"},
+      {"\x0b", "control character U+000B at byte 0"},
+      {"\x0c", "control character U+000C at byte 0"},
+      {"ok\x0e", "control character U+000E at byte 2"},
+      {"\x1f", "control character U+001F at byte 0"},
+      {"\xef\xbf\xbe", "noncharacter U+FFFE at byte 0"},
+      {"x\xef\xbf\xbf", "noncharacter U+FFFF at byte 1"},
+      {"\xff", "invalid UTF-8 at byte 0"},
+      {"ab\x80", "invalid UTF-8 at byte 2"},            // a lone continuation byte
+      {"\xc0\x80", "invalid UTF-8 at byte 0"},          // overlong NUL
+      {"\xc1\xbf", "invalid UTF-8 at byte 0"},          // overlong
+      {"\xe0\x9f\xbf", "invalid UTF-8 at byte 0"},      // overlong three bytes
+      {"\xf0\x8f\xbf\xbf", "invalid UTF-8 at byte 0"},  // overlong four bytes
+      {"\xed\xa0\x80", "invalid UTF-8 at byte 0"},      // a surrogate
+      {"\xf4\x90\x80\x80", "invalid UTF-8 at byte 0"},  // past U+10FFFF
+      {"\xf5\x80\x80\x80", "invalid UTF-8 at byte 0"},
+      {"\xe2\x82", "invalid UTF-8 at byte 0"},          // cut short at the end
+      {"\xe2\x82x", "invalid UTF-8 at byte 0"},
+  };
+  for (const Case& c : cases) {
+    const bool carried = c.why == nullptr;
+    std::string why = "untouched";
+    EXPECT_EQ(IsPropertyListString(c.text, &why), carried) << c.text;
+    EXPECT_EQ(why, carried ? "untouched" : c.why) << c.text;
+
+    // The writer refuses the same text as a key and as a value, and what it
+    // does write reads back unchanged.
+    std::string key_out, value_out, key_error, value_error;
+    Dictionary as_key;
+    as_key.Set(c.text, "v");
+    Array as_value;
+    as_value.Append(c.text);
+    EXPECT_EQ(WriteXMLPropertyList(as_key, key_out, &key_error), carried) << c.text;
+    EXPECT_EQ(WriteXMLPropertyList(as_value, value_out, &value_error), carried) << c.text;
+    if (!carried) {
+      EXPECT_EQ(key_error, std::string("key cannot be written to a property list: ") + c.why);
+      EXPECT_EQ(value_error, std::string("string cannot be written to a property list: ") + c.why);
+      EXPECT_EQ(value_out, "") << "nothing is emitted";
+      continue;
+    }
+    const ParseResult back = ParsePropertyList(value_out);
+    ASSERT_TRUE(back.ok()) << back.error << " for " << c.text;
+    EXPECT_EQ(back.value.AsArray()->at(0), Value(c.text));
+    EXPECT_TRUE(ParsePropertyList(key_out).value.AsDictionary()->Contains(c.text));
+  }
+}
+
 TEST(PlistTest, MalformedInputGivesAnErrorNotACrash) {
   const char* cases[] = {
       "",

@@ -1,4 +1,5 @@
 #include "driver/driver.h"
+#include "cf/plist.h"
 #include "platform/diagnostics.h"
 #include "platform/log.h"
 
@@ -11,6 +12,17 @@ bool gAppInfoRequested = false;
 namespace {
 // The single turn of the first message that is not an app-data message.
 bool gServiceTurnTaken = false;
+
+// The first text field of an app record that a property list cannot carry,
+// with the reason in *why.
+const char* UncarriedText(const cf::Value& record, std::string* why) {
+  for (const char* field : {"bundle_id", "version"}) {
+    const std::string* text = xpc_dictionary_get_string(record, field);
+    if (text && !cf::IsPropertyListString(*text, why)) return field;
+  }
+  return nullptr;
+}
+
 }  // namespace
 
 void HandleServiceConnection(const XPCEvent& event) {
@@ -46,6 +58,13 @@ void HandleServiceMessage(const XPCEvent& event) {
         cf::Value entry = AppInfoEntryFromRecord(record);
         if (entry.IsNull()) {
           LogError("Skipping an app record without bundle_id, version or uuid");
+          continue;
+        }
+        // The entry's text goes into the day's log: one string the log
+        // cannot carry would cost the whole log, so the record goes instead.
+        std::string why;
+        if (const char* field = UncarriedText(record, &why)) {
+          LogError("Skipping an app record whose %s a property list cannot carry (%s)", field, why);
           continue;
         }
         list.Append(entry);

@@ -5,6 +5,7 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "platform/prefs.h"
 #include "platform/store.h"
 
 namespace platform {
@@ -18,15 +19,16 @@ constexpr const char* kPrefixClause =
 
 class ReadTransaction {
  public:
-  explicit ReadTransaction(sqlite3* db) : db_(db) { ok_ = sqlite3_exec(db, "BEGIN", nullptr, nullptr, nullptr) == SQLITE_OK; }
+  explicit ReadTransaction(sqlite3* db) : db_(db), result_(sqlite3_exec(db, "BEGIN", nullptr, nullptr, nullptr)) {}
   ~ReadTransaction() {
-    if (ok_) sqlite3_exec(db_, "COMMIT", nullptr, nullptr, nullptr);
+    if (ok()) sqlite3_exec(db_, "COMMIT", nullptr, nullptr, nullptr);
   }
-  bool ok() const { return ok_; }
+  bool ok() const { return result_ == SQLITE_OK; }
+  int result() const { return result_; }
 
  private:
   sqlite3* db_;
-  bool ok_;
+  int result_;
 };
 
 struct Finalizer {
@@ -34,10 +36,24 @@ struct Finalizer {
 };
 using StatementPtr = std::unique_ptr<sqlite3_stmt, Finalizer>;
 
+// A read that did not finish: an error line, and a count of the corruption
+// for the next report, written at once since this process may not get far.
+bool ReadFailed(sqlite3* db, int rc) {
+  LogError("Tallybook history read failed: %s", sqlite3_errmsg(db));
+  const int primary = rc & 0xff;
+  if (primary == SQLITE_CORRUPT || primary == SQLITE_NOTADB) {
+    const int64_t count = DGVPreferencesGetIntegerValue(kStoreCorruptionKey, kStoreCorruptionDomain);
+    DGVPreferencesSetValue(kStoreCorruptionKey, cf::Value::SInt64(count + 1), kStoreCorruptionDomain);
+    DGVPreferencesSynchronize(kStoreCorruptionDomain);
+  }
+  return false;
+}
+
 StatementPtr Prepare(sqlite3* db, const std::string& sql) {
   sqlite3_stmt* s = nullptr;
-  if (sqlite3_prepare_v2(db, sql.c_str(), -1, &s, nullptr) != SQLITE_OK) {
-    LogError("Tallybook history query failed: %s", sqlite3_errmsg(db));
+  const int rc = sqlite3_prepare_v2(db, sql.c_str(), -1, &s, nullptr);
+  if (rc != SQLITE_OK) {
+    ReadFailed(db, rc);
     return nullptr;
   }
   return StatementPtr(s);
@@ -53,8 +69,10 @@ void BindRange(sqlite3_stmt* s, std::string_view prefix, int32_t min_day, int32_
 
 bool TBHistoryDistributionEnumerator::getNextValue(double* value, int32_t* secondsInDayOffset) {
   if (done_ || !stmt_) return false;
-  if (sqlite3_step(stmt_) != SQLITE_ROW) {
+  const int rc = sqlite3_step(stmt_);
+  if (rc != SQLITE_ROW) {
     done_ = true;
+    if (rc != SQLITE_DONE) error_ = rc;
     return false;
   }
   if (value) *value = sqlite3_column_double(stmt_, 0);
@@ -80,7 +98,7 @@ TBHistory::~TBHistory() = default;
 bool TBHistory::scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
                                     const ScalarHandler& rowHandler) {
   ReadTransaction txn(db_);
-  if (!txn.ok()) return false;
+  if (!txn.ok()) return ReadFailed(db_, txn.result());
   StatementPtr rows = Prepare(db_, std::string("SELECT key, day, value FROM scalars WHERE day > ?1 AND day <= ?2") +
                                        kPrefixClause + " ORDER BY day, key");
   if (!rows) return false;
@@ -94,13 +112,13 @@ bool TBHistory::scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSinc
     rowHandler(key, sqlite3_column_int(rows.get(), 1), sqlite3_column_int64(rows.get(), 2), &stop);
     if (stop) return true;
   }
-  return rc == SQLITE_DONE;
+  return rc == SQLITE_DONE || ReadFailed(db_, rc);
 }
 
 bool TBHistory::distributionsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970,
                                           int32_t maxDaysSince1970, const DistributionHandler& rowHandler) {
   ReadTransaction txn(db_);
-  if (!txn.ok()) return false;
+  if (!txn.ok()) return ReadFailed(db_, txn.result());
   StatementPtr rows = Prepare(db_, std::string("SELECT id, key, day FROM series WHERE day > ?1 AND day <= ?2") +
                                        kPrefixClause + " ORDER BY day, key");
   StatementPtr samples = Prepare(db_, "SELECT value, offset FROM samples WHERE series = ?1 ORDER BY seq");
@@ -116,9 +134,10 @@ bool TBHistory::distributionsForKeyPrefix(std::string_view prefix, int32_t minDa
     TBHistoryDistributionEnumerator enumerator(samples.get());
     bool stop = false;
     rowHandler(key, sqlite3_column_int(rows.get(), 2), enumerator, &stop);
+    if (enumerator.error_ != 0) return ReadFailed(db_, enumerator.error_);
     if (stop) return true;
   }
-  return rc == SQLITE_DONE;
+  return rc == SQLITE_DONE || ReadFailed(db_, rc);
 }
 
 }  // namespace platform

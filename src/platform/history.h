@@ -19,7 +19,8 @@ class TallyStore;
 
 class TBHistoryDistributionEnumerator {
  public:
-  // False when no sample is left.
+  // False when no sample is left, or when the store could not be read: the
+  // history call then reports the failure.
   bool getNextValue(double* value, int32_t* secondsInDayOffset);
 
  private:
@@ -27,6 +28,7 @@ class TBHistoryDistributionEnumerator {
   explicit TBHistoryDistributionEnumerator(sqlite3_stmt* stmt) : stmt_(stmt) {}
   sqlite3_stmt* stmt_;
   bool done_ = false;
+  int error_ = 0;  // the SQLite result that ended the samples early
 };
 
 class TBHistory {
@@ -43,7 +45,9 @@ class TBHistory {
   // Rows of the days after min, up to and including max (min < day <= max),
   // whose key starts with prefix, ordered by day, then key: the report asks
   // for (D - 1, D] and gets exactly day D. False when the store could not be
-  // read.
+  // read, even part-way: the rows delivered are then not the whole answer.
+  // A read error is logged, and corruption is counted in the preference
+  // kStoreCorruptionKey of kStoreCorruptionDomain.
   bool scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSince1970, int32_t maxDaysSince1970,
                            const ScalarHandler& rowHandler);
   // One row per key and day, in the same order; the enumerator yields that

@@ -73,14 +73,32 @@ cf::Value Preferences::Get(std::string_view domain, const cf::Value& key) {
   return d->on_disk.Get(key).DeepCopy();
 }
 
-void Preferences::Set(std::string_view domain, const cf::Value& key, cf::Value value) {
+bool Preferences::Set(std::string_view domain, const cf::Value& key, cf::Value value) {
   if (!IsValidPreferenceDomain(domain)) {
     LogError("Invalid preference domain \"%s\"", std::string(domain));
-    return;
+    return false;
+  }
+  // The value is asked of the writer itself, so that what is refused here is
+  // exactly what could not be written at synchronize.
+  std::string why, scratch;
+  // A key that is itself the bad text is not printed.
+  std::string name = key.AsString() ? *key.AsString() : key.Description();
+  if (!key.AsString()) {
+    why = "the key is " + cf::TypeNameWithArticle(key.type()) + ", not a string";
+  } else if (std::string text_why; !cf::IsPropertyListString(*key.AsString(), &text_why)) {
+    why = "key cannot be written to a property list: " + text_why;
+    name = "(unprintable key)";
+  } else if (!value.IsNull() && !cf::WriteXMLPropertyList(value, scratch, &why) && why.empty()) {
+    why = "the value cannot be written to a property list";
+  }
+  if (!why.empty()) {
+    LogError("Not setting preference %s of domain %s: %s", name, std::string(domain), why);
+    return false;
   }
   auto it = domains_.find(domain);
   if (it == domains_.end()) it = domains_.emplace(std::string(domain), Domain{}).first;
   it->second.pending.Set(key.DeepCopy(), value.DeepCopy());
+  return true;
 }
 
 bool Preferences::Synchronize(std::string_view domain) {

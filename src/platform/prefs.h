@@ -21,8 +21,10 @@ class Preferences {
   ~Preferences();
 
   cf::Value Get(std::string_view domain, const cf::Value& key);
-  // A null value removes the key.
-  void Set(std::string_view domain, const cf::Value& key, cf::Value value);
+  // A null value removes the key. Refuses (false, with an error line) a key
+  // that is not a string or a value the property-list writer cannot store:
+  // kept pending, it would keep the whole domain from being written.
+  bool Set(std::string_view domain, const cf::Value& key, cf::Value value);
   bool Synchronize(std::string_view domain);
   void SynchronizeAll();
   std::string PathFor(std::string_view domain) const;
@@ -52,6 +54,7 @@ bool IsValidPreferenceDomain(std::string_view domain);
 // ---- the system's preference calls, over the current context ----
 
 cf::Value DGVPreferencesGetValue(const cf::Value& key, std::string_view domain);
+// Refuses what Preferences::Set refuses; the rest of the domain is unaffected.
 void DGVPreferencesSetValue(const cf::Value& key, const cf::Value& value, std::string_view domain);
 // A missing key gives 0. *exists (when given) tells whether the key held a
 // number, a boolean or a numeric string.

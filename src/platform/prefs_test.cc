@@ -134,6 +134,63 @@ TEST_F(PrefsTest, BadFileReadsEmptyWithOneErrorAndIsOnlyReplacedByAWrite) {
   EXPECT_FALSE(FileExists(root / "Library/escape.plist"));
 }
 
+TEST_F(PrefsTest, AValueTheFileCannotHoldIsRefusedAndTheDomainIsStillWritten) {
+  cf::Dictionary nested_bad_string;
+  nested_bad_string.Set("Value", cf::Array({cf::Value("ok"), cf::Value("bell\x07")}));
+  cf::Dictionary bad_inner_key;
+  bad_inner_key.Set("\xff\xfe", cf::Value::SInt32(1));
+  cf::Dictionary number_inner_key;
+  number_inner_key.Set(cf::Value::SInt32(5), "five");
+  struct Case {
+    cf::Value key;
+    cf::Value value;
+    const char* line;
+  };
+  const Case cases[] = {
+      {"Payload", nested_bad_string,
+       "Not setting preference Payload of domain com.velmora.tallybookd.tallyrun: string cannot be written to a "
+       "property list: control character U+0007 at byte 4"},
+      {"Inner", bad_inner_key,
+       "Not setting preference Inner of domain com.velmora.tallybookd.tallyrun: key cannot be written to a property "
+       "list: invalid UTF-8 at byte 0"},
+      {"Numbered", number_inner_key,
+       "Not setting preference Numbered of domain com.velmora.tallybookd.tallyrun: dictionary key of type number "
+       "cannot be written to a property list"},
+      {"Holes", cf::Array({cf::Value::SInt32(1), cf::Value()}),
+       "Not setting preference Holes of domain com.velmora.tallybookd.tallyrun: null cannot be written to a property "
+       "list"},
+      {"Nonchar", "\xef\xbf\xbf",
+       "Not setting preference Nonchar of domain com.velmora.tallybookd.tallyrun: string cannot be written to a "
+       "property list: noncharacter U+FFFF at byte 0"},
+      {"Key\x01", cf::Value::SInt32(1),
+       "Not setting preference (unprintable key) of domain com.velmora.tallybookd.tallyrun: key cannot be written to "
+       "a property list: control character U+0001 at byte 3"},
+      {cf::Value::SInt32(7), cf::Value::SInt32(1),
+       "Not setting preference 7 of domain com.velmora.tallybookd.tallyrun: the key is a number, not a string"},
+  };
+  DGVPreferencesSetValue("Payload", "the good one", kDomain);
+  DGVPreferencesSetValue("LastCrashLogSerializationDateInDaysSince1970", cf::Value::SInt32(20778), kDomain);
+  for (const Case& c : cases) {
+    log->Clear();
+    DGVPreferencesSetValue(c.key, c.value, kDomain);
+    EXPECT_EQ(log->Count(c.line), 1u) << c.line << "\n" << (log->lines().empty() ? "" : log->lines()[0].text);
+  }
+  // What was set before stays visible, and the domain is still written.
+  EXPECT_EQ(DGVPreferencesGetValue("Payload", kDomain), cf::Value("the good one"));
+  ASSERT_TRUE(DGVPreferencesSynchronize(kDomain));
+  const cf::Value on_disk = cf::ParsePropertyList(*ReadFile(file)).value;
+  ASSERT_NE(on_disk.AsDictionary(), nullptr);
+  EXPECT_EQ(on_disk.AsDictionary()->size(), 2u);
+  EXPECT_EQ(on_disk.AsDictionary()->Get("LastCrashLogSerializationDateInDaysSince1970"), cf::Value::SInt32(20778));
+
+  // The store object answers for itself; a removal (null) is always fine.
+  Preferences direct(root / "Library/Preferences");
+  EXPECT_FALSE(direct.Set(kDomain, "Payload", nested_bad_string));
+  EXPECT_TRUE(direct.Set(kDomain, "Payload", cf::Value()));
+  EXPECT_TRUE(direct.Synchronize(kDomain));
+  EXPECT_FALSE(cf::ParsePropertyList(*ReadFile(file)).value.AsDictionary()->Contains("Payload"));
+}
+
 TEST(PrefsExitTest, PendingChangesAreWrittenAtNormalExit) {
   TempDir root;
   const pid_t child = fork();

@@ -1,12 +1,17 @@
 #include "platform/store.h"
 
 #include <sqlite3.h>
+#include <unistd.h>
 
+#include <cctype>
+#include <cerrno>
 #include <chrono>
 #include <cmath>
-#include <thread>
+#include <cstring>
 #include <ctime>
+#include <thread>
 
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/files.h"
@@ -50,6 +55,30 @@ class Statement {
   sqlite3_stmt* stmt_ = nullptr;
 };
 
+std::string Lowered(const char* text) {
+  std::string s = text;
+  if (!s.empty()) s[0] = static_cast<char>(std::tolower(static_cast<unsigned char>(s[0])));
+  return s;
+}
+
+// When SQLite cannot open or read a store, the cause is often access, not
+// content: say so plainly, so that a read-only directory is not taken for a
+// foreign file. Empty when access is not the problem.
+std::string AccessProblem(const std::string& path) {
+  if (access(path.c_str(), R_OK | W_OK) != 0 && errno != ENOENT) {
+    const int cause = errno;
+    return "the file cannot be read and written (" + Lowered(std::strerror(cause)) + ")";
+  }
+  const size_t slash = path.find_last_of('/');
+  const std::string dir = slash == std::string::npos ? "." : slash == 0 ? "/" : path.substr(0, slash);
+  if (access(dir.c_str(), W_OK | X_OK) != 0) {
+    const int cause = errno;
+    return "its directory " + dir + " is not writable (" + Lowered(std::strerror(cause)) +
+           "), and the store keeps its write-ahead log beside it";
+  }
+  return {};
+}
+
 }  // namespace
 
 std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode, std::string* error) {
@@ -59,15 +88,18 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   };
   if (mode == Mode::kCreate) {
     const size_t slash = path.find_last_of('/');
-    if (slash != std::string::npos && slash > 0 && !MakeDirectories(path.substr(0, slash)))
-      return fail("cannot create the directory of " + path);
+    if (slash != std::string::npos && slash > 0 && !MakeDirectories(path.substr(0, slash))) {
+      const int cause = errno;
+      return fail("cannot create the directory of " + path + " (" + Lowered(std::strerror(cause)) + ")");
+    }
   } else if (!FileExists(path)) {
     return fail("no store at " + path);
   }
   sqlite3* db = nullptr;
   const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | (mode == Mode::kCreate ? SQLITE_OPEN_CREATE : 0);
   if (sqlite3_open_v2(path.c_str(), &db, flags, nullptr) != SQLITE_OK) {
-    std::string why = db ? sqlite3_errmsg(db) : "out of memory";
+    std::string why = AccessProblem(path);
+    if (why.empty()) why = db ? sqlite3_errmsg(db) : "out of memory";
     sqlite3_close(db);
     return fail("cannot open store " + path + ": " + why);
   }
@@ -79,8 +111,11 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   int foreign_tables = 0;
   {
     Statement st(db, "SELECT count(*) FROM sqlite_master WHERE type='table' AND name NOT IN ('scalars','series','samples')");
-    if (!st || sqlite3_step(st.get()) != SQLITE_ROW)
+    if (!st || sqlite3_step(st.get()) != SQLITE_ROW) {
+      const std::string why = AccessProblem(path);
+      if (!why.empty()) return fail("cannot open store " + path + ": " + why);
       return fail(path + " is not a Tallybook store (" + sqlite3_errmsg(db) + ")");
+    }
     foreign_tables = sqlite3_column_int(st.get(), 0);
   }
   {
@@ -97,7 +132,10 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   if (version != 0 && version < kStoreSchemaVersion)
     return fail(path + " has unknown store schema version " + std::to_string(version));
 
-  if (!store->EnableWriteAheadLog()) return fail(store->last_error_);
+  if (!store->EnableWriteAheadLog()) {
+    const std::string why = AccessProblem(path);
+    return fail(why.empty() ? store->last_error_ : "cannot open store " + path + ": " + why);
+  }
   store->Exec("PRAGMA synchronous=NORMAL");
   if (version == 0) {
     // Another process may be creating the schema at the same moment: decide
@@ -131,7 +169,19 @@ bool TallyStore::EnableWriteAheadLog() {
 
 bool TallyStore::Fail(const char* what) {
   last_error_ = std::string(what) + ": " + sqlite3_errmsg(db_);
+  bad_input_ = false;
   return false;
+}
+
+bool TallyStore::BadInput(std::string why) {
+  last_error_ = std::move(why);
+  bad_input_ = true;
+  return false;
+}
+
+bool TallyStore::CheckKey(std::string_view key) {
+  std::string why;
+  return cf::IsPropertyListString(key, &why) || BadInput("key cannot be stored, a property list cannot carry it: " + why);
 }
 
 bool TallyStore::Exec(const char* sql) {
@@ -164,6 +214,7 @@ bool TallyStore::InTransaction(const std::function<bool()>& body) {
 bool TallyStore::Batch(const std::function<bool()>& body) { return InTransaction(body); }
 
 bool TallyStore::WriteScalar(const char* sql, const char* what, int32_t day, std::string_view key, int64_t value) {
+  if (!CheckKey(key)) return false;
   Statement st(db_, sql);
   if (!st) return Fail(what);
   sqlite3_bind_int(st.get(), 1, day);
@@ -180,14 +231,23 @@ bool TallyStore::SetScalar(int32_t day, std::string_view key, int64_t value) {
 
 bool TallyStore::AddScalar(int32_t day, std::string_view key, int64_t value) {
   // One statement: the read and the write happen under the same write lock,
-  // so concurrent adders never lose each other's increments.
-  return WriteScalar("INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
-                     "ON CONFLICT(day, key) DO UPDATE SET value = value + excluded.value",
-                     "add scalar", day, key, value);
+  // so concurrent adders never lose each other's increments. SQLite would
+  // turn an overflowing sum into a real that then sticks, so a sum past the
+  // range leaves the row alone, and no change at all tells us so.
+  if (!WriteScalar("INSERT INTO scalars(day, key, value) VALUES(?1, ?2, ?3) "
+                   "ON CONFLICT(day, key) DO UPDATE SET value = value + excluded.value "
+                   "WHERE (excluded.value >= 0 AND value <= 9223372036854775807 - excluded.value) "
+                   "OR (excluded.value < 0 AND value >= -9223372036854775807 - 1 - excluded.value)",
+                   "add scalar", day, key, value))
+    return false;
+  if (sqlite3_changes(db_) > 0) return true;
+  return BadInput("adding " + std::to_string(value) + " to " + std::string(key) +
+                  " would take its value past the signed 64-bit range");
 }
 
 bool TallyStore::PushSamples(int32_t day, std::string_view key,
                              const std::vector<std::pair<double, int32_t>>& samples) {
+  if (!CheckKey(key)) return false;
   return InTransaction([&] {
     Statement series(db_, "INSERT INTO series(day, key) VALUES(?1, ?2) ON CONFLICT(day, key) DO UPDATE SET day = day "
                           "RETURNING id");
@@ -223,10 +283,18 @@ bool TallyStore::PushSample(int32_t day, std::string_view key, double value, int
 }
 
 bool TallyStore::Checkpoint() {
-  int log_frames = 0, checkpointed = 0;
-  if (sqlite3_wal_checkpoint_v2(db_, nullptr, SQLITE_CHECKPOINT_PASSIVE, &log_frames, &checkpointed) != SQLITE_OK)
-    return Fail("checkpoint");
-  return true;
+  // A passive checkpoint never calls the busy handler: while another
+  // connection checkpoints (a writer's automatic one, say) it fails at once
+  // with "database is locked". Wait for it as the busy timeout would.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(kBusyTimeoutMs);
+  for (int attempt = 0;; ++attempt) {
+    int log_frames = 0, checkpointed = 0;
+    const int rc = sqlite3_wal_checkpoint_v2(db_, nullptr, SQLITE_CHECKPOINT_PASSIVE, &log_frames, &checkpointed);
+    if (rc == SQLITE_OK) return true;
+    if ((rc != SQLITE_BUSY && rc != SQLITE_LOCKED) || std::chrono::steady_clock::now() > deadline)
+      return Fail("checkpoint");
+    std::this_thread::sleep_for(std::chrono::milliseconds(1 + attempt % 10));
+  }
 }
 
 int32_t DaysSince1970At(double t) {

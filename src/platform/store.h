@@ -23,6 +23,10 @@ namespace platform {
 
 inline constexpr const char* kStoreDevicePath = "/var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
 inline constexpr int kStoreSchemaVersion = 1;
+// Where the store's components count the corruptions they meet; the report
+// reads the count and sets it back to 0.
+inline constexpr const char* kStoreCorruptionDomain = "com.velmora.tallybookd";
+inline constexpr const char* kStoreCorruptionKey = "DatabaseCorruptionCount";
 
 class TallyStore {
  public:
@@ -32,15 +36,22 @@ class TallyStore {
   static std::unique_ptr<TallyStore> Open(const std::string& path, Mode mode, std::string* error);
   ~TallyStore();
 
+  // Writes refuse a key that a property list cannot carry (cf::IsPropertyListString):
+  // one such key would keep the whole day's log from being written.
   bool SetScalar(int32_t day, std::string_view key, int64_t value);
+  // Refuses a sum past the signed 64-bit range and leaves the value as it was.
   bool AddScalar(int32_t day, std::string_view key, int64_t value);
   bool PushSample(int32_t day, std::string_view key, double value, int32_t seconds_in_day);
   // Many samples of one key in one transaction (tools and benchmarks).
   bool PushSamples(int32_t day, std::string_view key, const std::vector<std::pair<double, int32_t>>& samples);
   // Many operations in one transaction; the body's writes use the methods above.
   bool Batch(const std::function<bool()>& body);
+  // Waits (up to the busy timeout) for a concurrent writer or checkpointer.
   bool Checkpoint();
   const std::string& last_error() const { return last_error_; }
+  // Whether the last failure was the caller's input (a bad key, an overflowing
+  // sum) rather than the store itself.
+  bool last_error_is_bad_input() const { return bad_input_; }
   const std::string& path() const { return path_; }
   sqlite3* handle() { return db_; }
 
@@ -50,11 +61,14 @@ class TallyStore {
   bool WriteScalar(const char* sql, const char* what, int32_t day, std::string_view key, int64_t value);
   bool EnableWriteAheadLog();
   bool Fail(const char* what);
+  bool BadInput(std::string why);
+  bool CheckKey(std::string_view key);
   bool InTransaction(const std::function<bool()>& body);
 
   sqlite3* db_;
   std::string path_;
   std::string last_error_;
+  bool bad_input_ = false;
   int batch_depth_ = 0;
 };
 

@@ -5,14 +5,21 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <cstdint>
+#include <filesystem>
+#include <thread>
 #include <vector>
 
+#include "../../tests/store_pages.h"
 #include "../../tests/temp_dir.h"
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/history.h"
 #include "platform/log.h"
+#include "platform/prefs.h"
 
 namespace platform {
 namespace {
@@ -218,6 +225,202 @@ TEST(StoreTest, ClientCallsWriteTodayUnderTheRoot) {
   EXPECT_FALSE(TBClientCheckpoint());
   EXPECT_EQ(log->CountContaining("Tallybook store unavailable"), 1u);
   EXPECT_EQ(*ReadFile(bad / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb"), "garbage");
+}
+
+// The stored value and its SQLite type, straight from the table.
+std::string Stored(TallyStore& store, int32_t day, const std::string& key) {
+  sqlite3_stmt* st = nullptr;
+  sqlite3_prepare_v2(store.handle(), "SELECT typeof(value), value FROM scalars WHERE day = ?1 AND key = ?2", -1, &st,
+                     nullptr);
+  sqlite3_bind_int(st, 1, day);
+  sqlite3_bind_text(st, 2, key.c_str(), -1, SQLITE_TRANSIENT);
+  std::string out = "none";
+  if (sqlite3_step(st) == SQLITE_ROW)
+    out = std::string(reinterpret_cast<const char*>(sqlite3_column_text(st, 0))) + " " +
+          reinterpret_cast<const char*>(sqlite3_column_text(st, 1));
+  sqlite3_finalize(st);
+  return out;
+}
+
+TEST(StoreTest, WritesRefuseKeysALogCannotCarry) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{std::make_shared<FixedClock>(86400.0 * 20000), log});
+  TallyStore& store = *Context::Current().store();
+  const std::string bad_keys[] = {"com.x.bad\x01key", "com.x.\xff", "com.x.\xef\xbf\xbe", std::string("nul\0", 4)};
+  for (const std::string& key : bad_keys) {
+    EXPECT_FALSE(store.SetScalar(1, key, 1));
+    EXPECT_TRUE(store.last_error_is_bad_input());
+    EXPECT_FALSE(store.AddScalar(1, key, 1));
+    EXPECT_FALSE(store.PushSample(1, key, 1, 0));
+    EXPECT_FALSE(store.PushSamples(1, key, {{1, 0}, {2, 0}}));
+    EXPECT_FALSE(TBClientSetValueForScalarKey(key, 1));
+    EXPECT_FALSE(TBClientAddValueForScalarKey(key, 1));
+    EXPECT_FALSE(TBClientPushValueForDistributionKey(key, 1, 0));
+  }
+  EXPECT_EQ(store.last_error(), "key cannot be stored, a property list cannot carry it: control character U+0000 at byte 3");
+  EXPECT_EQ(log->Count("Tallybook set failed: key cannot be stored, a property list cannot carry it: control "
+                       "character U+0001 at byte 9"),
+            1u);
+  EXPECT_EQ(log->CountContaining("Tallybook push failed: key cannot be stored"), 4u);
+  auto history = TBHistory::initWithDefaultPath();
+  ASSERT_NE(history, nullptr);
+  EXPECT_TRUE(Scalars(*history, "", INT32_MIN, INT32_MAX).empty());
+  int series = 0;
+  history->distributionsForKeyPrefix("", INT32_MIN, INT32_MAX,
+                                     [&](const std::string&, int32_t, TBHistoryDistributionEnumerator&, bool*) { ++series; });
+  EXPECT_EQ(series, 0);
+}
+
+TEST(StoreTest, AddingPastTheRangeIsRefused) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{std::make_shared<FixedClock>(86400.0 * 20000), log});
+  TallyStore& store = *Context::Current().store();
+  // Sums at both ends of the range: one past is refused and leaves an
+  // integer behind, never a real.
+  struct Sum {
+    int64_t start, add;
+    bool ok;
+    int64_t end;
+  };
+  const Sum sums[] = {
+      {INT64_MAX - 1, 1, true, INT64_MAX}, {INT64_MAX, 1, false, INT64_MAX}, {INT64_MAX, INT64_MIN, true, -1},
+      {1, INT64_MAX, false, 1},            {INT64_MIN + 1, -1, true, INT64_MIN}, {INT64_MIN, -1, false, INT64_MIN},
+      {-1, INT64_MIN, false, -1},          {0, INT64_MIN, true, INT64_MIN},      {INT64_MIN, INT64_MAX, true, -1},
+  };
+  for (size_t i = 0; i < std::size(sums); ++i) {
+    const std::string key = "sum." + std::to_string(i);
+    ASSERT_TRUE(store.SetScalar(2, key, sums[i].start));
+    EXPECT_EQ(store.AddScalar(2, key, sums[i].add), sums[i].ok) << key;
+    EXPECT_TRUE(sums[i].ok || store.last_error_is_bad_input()) << key;
+    EXPECT_EQ(Stored(store, 2, key), "integer " + std::to_string(sums[i].end)) << key;
+  }
+  EXPECT_EQ(store.last_error(), "adding -9223372036854775808 to sum.6 would take its value past the signed 64-bit range");
+  EXPECT_TRUE(store.AddScalar(2, "sum.new", INT64_MIN));  // a new row takes any value
+  EXPECT_EQ(Stored(store, 2, "sum.new"), "integer -9223372036854775808");
+  ASSERT_TRUE(TBClientSetValueForScalarKey("sum.client", INT64_MAX));
+  EXPECT_FALSE(TBClientAddValueForScalarKey("sum.client", 1));
+  EXPECT_EQ(log->Count("Tallybook add failed: adding 1 to sum.client would take its value past the signed 64-bit "
+                       "range"),
+            1u);
+}
+
+TEST(StoreTest, CheckpointWaitsForAnotherConnectionsCheckpoint) {
+  TempDir dir;
+  const std::string path = dir / "s.sqlitedb";
+  auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+  ASSERT_NE(store, nullptr);
+  ASSERT_TRUE(store->SetScalar(1, "k", 1));
+
+  // A writer holds the write lock; a second connection starts a full
+  // checkpoint, which takes the checkpoint lock and then waits for the
+  // writer. Our checkpoint meets that lock.
+  sqlite3* writer = nullptr;
+  sqlite3* checkpointer = nullptr;
+  ASSERT_EQ(sqlite3_open(path.c_str(), &writer), SQLITE_OK);
+  ASSERT_EQ(sqlite3_open(path.c_str(), &checkpointer), SQLITE_OK);
+  // A connection joins the write-ahead log only once it has read.
+  ASSERT_EQ(sqlite3_exec(checkpointer, "SELECT count(*) FROM scalars", nullptr, nullptr, nullptr), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(writer, "BEGIN IMMEDIATE; INSERT INTO scalars VALUES(1, 'w', 1)", nullptr, nullptr, nullptr),
+            SQLITE_OK);
+  std::atomic<bool> waiting{false}, release{false};
+  sqlite3_busy_handler(
+      checkpointer,
+      [](void* flag, int) {
+        static_cast<std::atomic<bool>*>(flag)->store(true);
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+        return 1;
+      },
+      &waiting);
+  int checkpointer_rc = -1;
+  std::thread full([&] {
+    checkpointer_rc = sqlite3_wal_checkpoint_v2(checkpointer, nullptr, SQLITE_CHECKPOINT_FULL, nullptr, nullptr);
+  });
+  std::thread commit([&] {
+    while (!release) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));  // while our checkpoint is under way
+    sqlite3_exec(writer, "COMMIT", nullptr, nullptr, nullptr);
+  });
+  for (int i = 0; i < 10000 && !waiting; ++i) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  EXPECT_TRUE(waiting) << "the other checkpoint never waited for the writer";
+  release = true;
+  EXPECT_TRUE(store->Checkpoint()) << store->last_error();
+  commit.join();
+  full.join();
+  EXPECT_EQ(checkpointer_rc, SQLITE_OK);
+  sqlite3_close(writer);
+  sqlite3_close(checkpointer);
+}
+
+TEST(StoreTest, ACorruptPageIsAReadErrorAndIsCounted) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{std::make_shared<FixedClock>(86400.0 * 20000), log});
+  const std::string path = Context::Current().Path(kStoreDevicePath);
+  constexpr int kKeys = 3000, kSeries = 300, kSamples = 40;
+  {
+    auto store = TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr);
+    ASSERT_NE(store, nullptr);
+    ASSERT_TRUE(store->Batch([&] {
+      bool ok = true;
+      for (int i = 0; i < kKeys; ++i) ok = ok && store->SetScalar(11, "com.velmora.k" + std::to_string(10000 + i), i);
+      std::vector<std::pair<double, int32_t>> samples(kSamples, {1.5, 60});
+      for (int i = 0; i < kSeries; ++i) ok = ok && store->PushSamples(11, "com.velmora.d" + std::to_string(i), samples);
+      return ok;
+    }));
+  }  // the last connection folds the log into the file
+  int64_t page_size = 0;
+  const std::vector<int64_t> scalar_leaves = LeafPages(path, "scalars", &page_size);
+  const std::vector<int64_t> sample_leaves = LeafPages(path, "samples", &page_size);
+  ASSERT_GT(scalar_leaves.size(), 4u);
+  ASSERT_GT(sample_leaves.size(), 4u);
+  ASSERT_TRUE(OverwritePage(path, scalar_leaves[scalar_leaves.size() / 2], page_size));
+
+  auto history = TBHistory::initWithDefaultPath();
+  ASSERT_NE(history, nullptr);
+  int rows = 0;
+  EXPECT_FALSE(history->scalarsForKeyPrefix("", 10, 11, [&](const std::string&, int32_t, int64_t, bool*) { ++rows; }));
+  EXPECT_GT(rows, 0);
+  EXPECT_LT(rows, kKeys);
+  EXPECT_EQ(log->Count("Tallybook history read failed: database disk image is malformed"), 1u);
+  EXPECT_EQ(DGVPreferencesGetIntegerValue(kStoreCorruptionKey, kStoreCorruptionDomain), 1);
+
+  // Samples cut short by a bad page are a failure too, not a shorter day.
+  ASSERT_TRUE(OverwritePage(path, sample_leaves[sample_leaves.size() / 2], page_size));
+  history = TBHistory::initWithDefaultPath();
+  int samples = 0;
+  EXPECT_FALSE(history->distributionsForKeyPrefix(
+      "", 10, 11, [&](const std::string&, int32_t, TBHistoryDistributionEnumerator& e, bool*) {
+        while (e.getNextValue(nullptr, nullptr)) ++samples;
+      }));
+  EXPECT_LT(samples, kSeries * kSamples);
+  EXPECT_EQ(log->Count("Tallybook history read failed: database disk image is malformed"), 2u);
+  // Counted on disk at once, where the report's support library reads it.
+  const cf::Value on_disk =
+      cf::ParsePropertyList(ReadFile(root / "Library/Preferences/com.velmora.tallybookd.plist").value_or("")).value;
+  ASSERT_NE(on_disk.AsDictionary(), nullptr);
+  EXPECT_EQ(on_disk.AsDictionary()->Get("DatabaseCorruptionCount"), cf::Value::SInt64(2));
+}
+
+TEST(StoreTest, AStoreOutOfReachSaysWhy) {
+  if (geteuid() == 0) GTEST_SKIP() << "running as root: file permissions do not apply, so nothing is out of reach";
+  TempDir dir;
+  const std::string path = dir / "ro/s.sqlitedb";
+  ASSERT_NE(TallyStore::Open(path, TallyStore::Mode::kCreate, nullptr), nullptr);
+  namespace fs = std::filesystem;
+  fs::permissions(dir / "ro", fs::perms::owner_read | fs::perms::owner_exec);
+  std::string error;
+  EXPECT_EQ(TallyStore::Open(path, TallyStore::Mode::kExisting, &error), nullptr);
+  EXPECT_EQ(error, "cannot open store " + path + ": its directory " + (dir / "ro") +
+                       " is not writable (permission denied), and the store keeps its write-ahead log beside it");
+  EXPECT_EQ(TallyStore::Open(dir / "ro/new.sqlitedb", TallyStore::Mode::kCreate, &error), nullptr);
+  EXPECT_NE(error.find("is not writable (permission denied)"), std::string::npos) << error;
+
+  fs::permissions(dir / "ro", fs::perms::owner_all);
+  fs::permissions(path, fs::perms::none);
+  EXPECT_EQ(TallyStore::Open(path, TallyStore::Mode::kExisting, &error), nullptr);
+  EXPECT_EQ(error, "cannot open store " + path + ": the file cannot be read and written (permission denied)");
 }
 
 }  // namespace

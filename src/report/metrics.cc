@@ -4,12 +4,14 @@
 #include <cmath>
 #include <limits>
 
+#include "cf/plist.h"
 #include "platform/analytics.h"
 #include "platform/context.h"
 #include "platform/faultkeep.h"
 #include "platform/files.h"
 #include "platform/loader.h"
 #include "platform/log.h"
+#include "platform/store.h"
 #include "platform/system.h"
 #include "report/report.h"
 
@@ -86,9 +88,9 @@ bool ResolveSupportFunctions(SupportFunctions& f) {
 int64_t ReadAndResetCorruptionCount() {
   static SupportFunctions functions;
   if (!ResolveSupportFunctions(functions)) return 0;
-  const int64_t count = functions.get("DatabaseCorruptionCount", "com.velmora.tallybookd", nullptr);
+  const int64_t count = functions.get(platform::kStoreCorruptionKey, platform::kStoreCorruptionDomain, nullptr);
   const cf::Value zero = cf::Value::SInt64(0);
-  functions.set("DatabaseCorruptionCount", &zero, "com.velmora.tallybookd");
+  functions.set(platform::kStoreCorruptionKey, &zero, platform::kStoreCorruptionDomain);
   return count;
 }
 
@@ -117,12 +119,16 @@ void TBReport::addInstalledAppInfo() {
 }
 
 void TBReport::addMetadataKeys() {
+  // The languages and region come from the environment and the device files:
+  // text the log cannot carry counts as unknown rather than costing the log.
+  auto carried = [](const cf::Value& v) { return v.AsString() && cf::IsPropertyListString(*v.AsString()); };
   const cf::Array preferred = preferredLanguages();
   const cf::Array best = preferredLocalizationsFromArray(systemLanguages(), preferred);
-  _metadataOutput.Set("TBUserInterfaceLanguage", best.empty() ? cf::Value("<unknown>") : best[0]);
-  _metadataOutput.Set("TBPreferredUserInterfaceLanguage", preferred.empty() ? cf::Value("<unknown>") : preferred[0]);
+  _metadataOutput.Set("TBUserInterfaceLanguage", !best.empty() && carried(best[0]) ? best[0] : cf::Value("<unknown>"));
+  _metadataOutput.Set("TBPreferredUserInterfaceLanguage",
+                      !preferred.empty() && carried(preferred[0]) ? preferred[0] : cf::Value("<unknown>"));
   const cf::Value country = CurrentLocaleCountryCode();
-  if (!country.IsNull()) _metadataOutput.Set("TBUserSetRegionFormat", country);
+  if (carried(country)) _metadataOutput.Set("TBUserSetRegionFormat", country);
 }
 
 void TBReport::reportDatabaseSize() {

@@ -11,6 +11,19 @@
 using platform::LogError;
 using platform::LogInfo;
 
+namespace {
+
+// A key the log could not carry would cost the whole day's log; writers
+// refuse such keys, but a store may hold older ones.
+bool Carried(const std::string& key) {
+  std::string why;
+  if (cf::IsPropertyListString(key, &why)) return true;
+  LogError("Skipping a store key that a property list cannot carry: %s", why);
+  return false;
+}
+
+}  // namespace
+
 TBReport::TBReport() : _config(TBConfig::init()) {}
 
 void TBReport::writeLogForYesterday(int32_t day, const cf::Value& appInfo) {
@@ -22,17 +35,26 @@ void TBReport::writeLogForYesterday(int32_t day, const cf::Value& appInfo) {
       LogError("Could not open the store's history: %s", error);
     } else {
       // The row's day is not looked at: a key returned twice keeps the later row.
-      history->scalarsForKeyPrefix("", day - 1, day, [&](const std::string& key, int32_t, int64_t value, bool*) {
-        if (!_config) return;
-        if (auto options = _config->configOptionsForScalarKey(key)) addScalar(value, key, *options);
-      });
-      history->distributionsForKeyPrefix(
-          "", day - 1, day,
-          [&](const std::string& key, int32_t, platform::TBHistoryDistributionEnumerator& samples, bool*) {
-            if (!_config) return;
-            if (auto options = _config->configOptionsForDistributionKey(key))
-              computeAndAddDistribution(samples, key, *options);
-          });
+      const bool complete =
+          history->scalarsForKeyPrefix("", day - 1, day,
+                                       [&](const std::string& key, int32_t, int64_t value, bool*) {
+                                         if (!_config) return;
+                                         const auto options = _config->configOptionsForScalarKey(key);
+                                         if (options && Carried(key)) addScalar(value, key, *options);
+                                       }) &&
+          history->distributionsForKeyPrefix(
+              "", day - 1, day,
+              [&](const std::string& key, int32_t, platform::TBHistoryDistributionEnumerator& samples, bool*) {
+                if (!_config) return;
+                const auto options = _config->configOptionsForDistributionKey(key);
+                if (options && Carried(key)) computeAndAddDistribution(samples, key, *options);
+              });
+      // Part of a day submitted as the whole of it would be wrong data; the
+      // history has said why, and counted a corruption.
+      if (!complete) {
+        LogError("Not writing the aggregated log for day %d: the store could not be read completely", day);
+        return;
+      }
     }
   }
   serializeWithDate(day, appInfo);

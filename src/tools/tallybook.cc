@@ -9,6 +9,7 @@
 #include <string>
 
 #include "tools/cli.h"
+#include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/history.h"
@@ -117,6 +118,7 @@ int main(int argc, char** argv) {
     std::printf("%d\n", TBDaysSince1970());
     return 0;
   }
+  if (const auto status = CheckDeviceRoot("tallybook")) return *status;
   if (dump->parsed()) {
     if (day_opt->count() && (day < std::numeric_limits<int32_t>::min() || day > std::numeric_limits<int32_t>::max()))
       return BadInput("day number out of range: " + std::to_string(day));
@@ -126,6 +128,8 @@ int main(int argc, char** argv) {
   // Writes: every argument is checked before the store is opened, so bad
   // input never touches it.
   if (key.empty()) return BadInput("key must not be empty");
+  if (std::string why; !cf::IsPropertyListString(key, &why))
+    return BadInput("key cannot be stored, a property list cannot carry it: " + why);
   const int32_t today_number = TBDaysSince1970();
   if (push->parsed()) {
     double value = 0;
@@ -150,7 +154,7 @@ int main(int argc, char** argv) {
   const bool ok = set->parsed() ? store->SetScalar(today_number, key, value) : store->AddScalar(today_number, key, value);
   if (!ok) {
     std::fprintf(stderr, "tallybook: %s\n", store->last_error().c_str());
-    return kStoreError;
+    return store->last_error_is_bad_input() ? kBadInput : kStoreError;
   }
   (void)add;
   return 0;

@@ -86,6 +86,7 @@ int main(int argc, char** argv) {
   send->add_option("OPERATION", operation)->required();
   auto* value_opt = send->add_option("--value", value, "the message's \"value\"");
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
+  if (const auto status = CheckDeviceRoot("tallyctl")) return *status;
 
   cf::Dictionary message;
   if (logging->parsed()) {

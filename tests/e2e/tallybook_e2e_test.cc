@@ -2,8 +2,11 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <filesystem>
+
 #include "../temp_dir.h"
 #include "platform/files.h"
+#include "platform/store.h"
 #include "run.h"
 
 namespace {
@@ -48,6 +51,7 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
       {"set", "", "1"},
       {"set", "k", "1.5"},
       {"set", "k", "9223372036854775808"},
+      {"set", "k", "-9223372036854775809"},
       {"add", "k", "twelve"},
       {"add", "k", ""},
       {"push", "k", "nan"},
@@ -58,6 +62,10 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
       {},
       {"set", "k"},
       {"dump", "--day", "99999999999"},
+      // Keys the day's log could not carry.
+      {"set", "com.x.bad\x01key", "5"},
+      {"add", "com.x.\xff", "1"},
+      {"push", "com.x.\xef\xbf\xbf", "1"},
   };
   for (const auto& args : bad) {
     const RunResult r = Tallybook(args);
@@ -69,6 +77,8 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
   }
   EXPECT_EQ(Tallybook({"set", "k", "x"}).err, "tallybook: value is not a signed 64-bit integer: \"x\"\n");
   EXPECT_EQ(Tallybook({"add", "", "1"}).err, "tallybook: key must not be empty\n");
+  EXPECT_EQ(Tallybook({"set", "com.x.bad\x01key", "5"}).err,
+            "tallybook: key cannot be stored, a property list cannot carry it: control character U+0001 at byte 9\n");
 
   // A file that is not a store: clear message, status 1, file untouched.
   ASSERT_TRUE(platform::WriteFileAtomically(root / kStore, "plain text, not a database"));
@@ -77,6 +87,91 @@ TEST_F(TallybookTest, BadInputExitsTwoAndLeavesTheStoreAlone) {
   EXPECT_NE(r.err.find("is not a Tallybook store"), std::string::npos) << r.err;
   EXPECT_EQ(*platform::ReadFile(root / kStore), "plain text, not a database");
   EXPECT_EQ(Tallybook({"dump"}).status, 1);
+}
+
+TEST_F(TallybookTest, ValuesAtTheEdgesOfTheRange) {
+  EXPECT_EQ(Tallybook({"set", "com.velmora.max", "9223372036854775807"}).status, 0);
+  EXPECT_EQ(Tallybook({"set", "com.velmora.min", "-9223372036854775808"}).status, 0);
+  EXPECT_EQ(Tallybook({"set", "com.velmora.near", "9223372036854775806"}).status, 0);
+  EXPECT_EQ(Tallybook({"add", "com.velmora.near", "1"}).status, 0);
+  const std::string before = Tallybook({"dump"}).out;
+  EXPECT_EQ(before,
+            "20779 com.velmora.max 9223372036854775807\n"
+            "20779 com.velmora.min -9223372036854775808\n"
+            "20779 com.velmora.near 9223372036854775807\n");
+
+  // One past either end is refused, and the value stays an integer.
+  RunResult r = Tallybook({"add", "com.velmora.max", "1"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_EQ(r.err,
+            "tallybook: adding 1 to com.velmora.max would take its value past the signed 64-bit range\n");
+  r = Tallybook({"add", "com.velmora.min", "-1"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_EQ(r.err,
+            "tallybook: adding -1 to com.velmora.min would take its value past the signed 64-bit range\n");
+  EXPECT_EQ(Tallybook({"add", "com.velmora.near", "9223372036854775807"}).status, 2);
+  EXPECT_EQ(Tallybook({"set", "com.velmora.max", "9223372036854775808"}).status, 2);
+  EXPECT_EQ(Tallybook({"dump"}).out, before);
+  EXPECT_EQ(Tallybook({"add", "com.velmora.max", "-9223372036854775808"}).status, 0);
+  EXPECT_EQ(Tallybook({"dump", "--prefix", "com.velmora.max"}).out, "20779 com.velmora.max -1\n");
+}
+
+TEST_F(TallybookTest, AMissingOrUnreadableRootIsAnError) {
+  const std::string typo = root / "no/such/root";
+  env["TALLYRUN_ROOT"] = typo;
+  for (const auto& args : std::vector<std::vector<std::string>>{{"set", "k", "1"}, {"push", "k", "1"}, {"dump"}}) {
+    const RunResult r = Tallybook(args);
+    EXPECT_EQ(r.status, 1) << args[0];
+    EXPECT_EQ(r.err, "tallybook: no device root at " + typo + " (TALLYRUN_ROOT); make one with: devsim init " + typo +
+                         "\n");
+  }
+  EXPECT_FALSE(platform::FileExists(root / "no"));
+  const RunResult ctl = RunProgram(TALLYCTL_BIN, {"logging-status"}, env);
+  EXPECT_EQ(ctl.status, 1);
+  EXPECT_EQ(ctl.err, "tallyctl: no device root at " + typo + " (TALLYRUN_ROOT); make one with: devsim init " + typo + "\n");
+  ASSERT_TRUE(platform::WriteFileAtomically(root / "file", "x"));
+  env["TALLYRUN_ROOT"] = root / "file";
+  EXPECT_EQ(Tallybook({"set", "k", "1"}).err, "tallybook: the device root " + (root / "file") + " is not a directory\n");
+  EXPECT_EQ(Tallybook({"today"}).status, 0);  // needs no root
+
+  // A root locked against everyone, the superuser included.
+  namespace fs = std::filesystem;
+  env["TALLYRUN_ROOT"] = root.path();
+  fs::permissions(root.path(), fs::perms::none);
+  RunResult r = Tallybook({"set", "k", "3"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: cannot read the device root " + root.path() + ": Permission denied\n");
+  r = RunProgram(TALLYCTL_BIN, {"logging-status"}, env);
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallyctl: cannot read the device root " + root.path() + ": Permission denied\n");
+  fs::permissions(root.path(), fs::perms::owner_all);
+  EXPECT_FALSE(platform::FileExists(root / "var"));
+}
+
+TEST_F(TallybookTest, ARootOrStoreOutOfReachSaysWhy) {
+  if (geteuid() == 0) GTEST_SKIP() << "running as root: file permissions do not apply, so nothing is out of reach";
+  namespace fs = std::filesystem;
+  {
+    // Closed as the daily job closes it: no log files are left beside it.
+    auto store = platform::TallyStore::Open(root / kStore, platform::TallyStore::Mode::kCreate, nullptr);
+    ASSERT_TRUE(store && store->SetScalar(20779, "k", 1));
+  }
+  const std::string dir = root / "var/mobile/Library/Tallybook";
+  fs::permissions(dir, fs::perms::owner_read | fs::perms::owner_exec);
+  RunResult r = Tallybook({"set", "k", "2"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: cannot open store " + (root / kStore) + ": its directory " + dir +
+                       " is not writable (permission denied), and the store keeps its write-ahead log beside it\n");
+  fs::permissions(dir, fs::perms::owner_all);
+
+  // Readable only by its owner: another user may not use it.
+  fs::permissions(root.path(), fs::perms::owner_write | fs::perms::owner_exec | fs::perms::group_read |
+                                   fs::perms::group_exec | fs::perms::others_read | fs::perms::others_exec);
+  r = Tallybook({"set", "k", "3"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: cannot read the device root " + root.path() + ": Permission denied\n");
+  fs::permissions(root.path(), fs::perms::owner_all);
+  EXPECT_EQ(Tallybook({"dump"}).out, "20779 k 1\n");
 }
 
 TEST_F(TallybookTest, ParallelProcessesAddExactly) {

@@ -1,8 +1,11 @@
 // The daily job as a process: modes, gate, report, OS changes and the
 // service's messages, in a fresh device root made by devsim.
+#include <sqlite3.h>
+
 #include <set>
 #include <thread>
 
+#include "../store_pages.h"
 #include "root_fixture.h"
 
 namespace {
@@ -280,6 +283,99 @@ TEST_F(TallyrunTest, IdleServiceEndsAfterTenQuietSeconds) {
   EXPECT_EQ(Count(r.err, "\n"), 2u);  // the start and end lines only
   EXPECT_EQ(Count(r.err, "tallyrun started"), 1u);
   EXPECT_EQ(Count(r.err, "tallyrun ended"), 1u);
+}
+
+// Runs SQL on the root's store as another writer of it would.
+void StoreSQL(const std::string& root, const std::string& sql) {
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open((root + "/var/mobile/Library/Tallybook/TBDataStore.sqlitedb").c_str(), &db), SQLITE_OK);
+  char* message = nullptr;
+  EXPECT_EQ(sqlite3_exec(db, sql.c_str(), nullptr, nullptr, &message), SQLITE_OK) << (message ? message : "");
+  sqlite3_free(message);
+  sqlite3_close(db);
+}
+
+TEST_F(TallyrunTest, OneBadValueNeverCostsTheDay) {
+  // A listed key the log cannot carry, left in the store by an older writer.
+  StoreSQL(root.path(), "INSERT INTO scalars VALUES(20778, 'com.velmora.wifi.Bad' || char(1), 5);"
+                        "INSERT INTO series(day, key) VALUES(20778, 'com.velmora.net.Bad' || char(65535));"
+                        "INSERT INTO samples SELECT id, 1, 2.5, 0 FROM series WHERE key LIKE 'com.velmora.net.Bad%'");
+  RunResult r = Tallyrun({"-f"});
+  ASSERT_EQ(Logs().size(), 1u) << r.err;
+  EXPECT_EQ(Count(r.err, "<error>: Skipping a store key that a property list cannot carry: control character U+0001 "
+                         "at byte 20\n"),
+            1u);
+  EXPECT_EQ(Count(r.err, "<error>: Skipping a store key that a property list cannot carry: noncharacter U+FFFF at "
+                         "byte 19\n"),
+            1u);
+  cf::Dictionary log = LastLog();
+  EXPECT_EQ(log.Get("TBScalars").AsDictionary()->Get("com.velmora.power.ChargeCycles"), cf::Value::SInt64(412));
+  EXPECT_TRUE(log.Get("TBDistributions").AsDictionary()->Contains("com.velmora.net.DNSLatencyMs"));
+
+  // A language and region from the environment that the log cannot carry.
+  env["LANG"] = "de_D\x01E.UTF-8";
+  r = Tallyrun({"-f"});
+  ASSERT_EQ(Logs().size(), 2u) << r.err;
+  log = LastLog();
+  EXPECT_EQ(log.Get("TBMetadata").AsDictionary()->Get("TBPreferredUserInterfaceLanguage"), cf::Value("<unknown>"));
+  EXPECT_FALSE(log.Get("TBMetadata").AsDictionary()->Contains("TBUserSetRegionFormat"));
+  env.erase("LANG");
+
+  // An app record from the service whose text the log cannot carry is
+  // skipped; the others are kept.
+  const std::string apps = root / "apps.json";
+  ASSERT_TRUE(platform::WriteFileAtomically(apps, R"([
+    {"bundle_id": "com.example.\u0001bad", "version": "1", "adam_id": 1, "arch": 1,
+     "uuid": "0a1b2c3d-4e5f-6071-8293-a4b5c6d7e8f9"},
+    {"bundle_id": "com.example.notes", "version": "3.\u0008", "adam_id": 2, "arch": 1,
+     "uuid": "0a1b2c3d-4e5f-6071-8293-a4b5c6d7e8f9"},
+    {"bundle_id": "com.example.maps", "version": "1.0", "adam_id": 3, "arch": 1,
+     "uuid": "0a1b2c3d-4e5f-6071-8293-a4b5c6d7e8f9"}])"));
+  r = Serve({{"logging-status"}, {"app-data", apps}});
+  ASSERT_EQ(Logs().size(), 3u) << r.err;
+  EXPECT_EQ(Count(r.err, "<error>: Skipping an app record whose bundle_id a property list cannot carry (control "
+                         "character U+0001 at byte 12)\n"),
+            1u);
+  EXPECT_EQ(Count(r.err, "<error>: Skipping an app record whose version a property list cannot carry (control "
+                         "character U+0008 at byte 2)\n"),
+            1u);
+  const cf::Value info = LastLog().Get("TBActivatedAppInfo");
+  ASSERT_NE(info.AsArray(), nullptr);
+  ASSERT_EQ(info.AsArray()->size(), 1u);
+  EXPECT_EQ(info.AsArray()->at(0).AsDictionary()->Get("bundle"), cf::Value("com.example.maps"));
+}
+
+TEST_F(TallyrunTest, ACorruptStoreWithholdsTheLogAndIsCounted) {
+  // A busy day: enough listed keys for the scalars to span many pages.
+  std::string sql = "BEGIN;";
+  for (int i = 0; i < 2000; ++i)
+    sql += "INSERT INTO scalars VALUES(20778, 'com.velmora.wifi.Filler" + std::to_string(10000 + i) + "', " +
+           std::to_string(i) + ");";
+  StoreSQL(root.path(), sql + "COMMIT;");
+  const std::string store = root / "var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
+  int64_t page_size = 0;
+  const std::vector<int64_t> leaves = LeafPages(store, "scalars", &page_size);
+  ASSERT_GT(leaves.size(), 10u);
+  // Yesterday's rows come first in key order and fill nearly every leaf.
+  ASSERT_TRUE(OverwritePage(store, leaves[leaves.size() / 2], page_size));
+
+  RunResult r = Tallyrun({"-d"});
+  EXPECT_TRUE(Logs().empty());
+  EXPECT_EQ(Count(r.err, "<error>: Tallybook history read failed: database disk image is malformed\n"), 1u) << r.err;
+  EXPECT_EQ(Count(r.err, "<error>: Not writing the aggregated log for day 20778: the store could not be read "
+                         "completely\n"),
+            1u);
+  const cf::Value counter = ReadPlist(root / "Library/Preferences/com.velmora.tallybookd.plist");
+  ASSERT_NE(counter.AsDictionary(), nullptr);
+  EXPECT_EQ(counter.AsDictionary()->Get("DatabaseCorruptionCount"), cf::Value::SInt64(1));
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));  // the day counts as handled
+
+  // The next day's log, read from pages the damage did not reach, reports it.
+  env["TALLYRUN_NOW"] = "2026-11-23T15:00:00Z";
+  r = Tallyrun({"-d"});
+  ASSERT_EQ(Logs().size(), 1u) << r.err;
+  EXPECT_EQ(LastLog().Get("TBScalars").AsDictionary()->Get("com.velmora.diagvault.tbkd.database.corruptions"),
+            cf::Value::SInt64(1));
 }
 
 TEST_F(TallyrunTest, ToolsRefuseBadInput) {

@@ -137,6 +137,42 @@ TEST_F(Tasking, IdentifierWithoutPayloadPostsEveryRunAndBadEntriesAreSkipped) {
   EXPECT_EQ(Notifications(), 4u);
 }
 
+TEST_F(Tasking, AValueNoPreferenceFileCanHoldPoisonsNothing) {
+  // XML cannot carry the control character; the configuration arrives as a
+  // binary list, which can.
+  cf::Dictionary tasking;
+  tasking.Set("TaskingID", "T1");
+  tasking.Set("TaskingDigest", "digest-1");
+  tasking.Set("TaskingPayload", cf::Array({Entry("com.velmora.da", "mobile", "Power", cf::Value("on\x01")),
+                                           Entry("com.velmora.da", "mobile", "Network", cf::Value::Bool(true))}));
+  cf::Dictionary domain;
+  domain.Set("ScheduledTasking", tasking);
+  std::string bytes;
+  ASSERT_TRUE(cf::WriteBinaryPropertyList(domain, bytes, nullptr));
+  ASSERT_TRUE(platform::WriteFileAtomically(root / "var/diagvault/config/com.velmora.OTAFerrowin.plist", bytes));
+
+  RunResult r = Tallyrun({"-d"});
+  EXPECT_EQ(Count(r.err, "<error>: Not setting preference Power of domain com.velmora.da: string cannot be written to "
+                         "a property list: control character U+0001 at byte 2\n"),
+            1u)
+      << r.err;
+  EXPECT_EQ(Count(r.err, "<error>: Not setting preference TaskingPayload of domain com.velmora.tallybookd.tallyrun: "
+                         "string cannot be written to a property list: control character U+0001 at byte 2\n"),
+            1u);
+  EXPECT_EQ(Count(r.err, "Could not write preferences domain"), 0u);
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
+  EXPECT_EQ(Pref("TaskingID"), cf::Value("T1"));
+  EXPECT_EQ(Pref("TaskingDigest"), cf::Value("digest-1"));
+  EXPECT_TRUE(Pref("LastOSUpdate").AsDictionary());
+  EXPECT_EQ(PrefIn("Library/Preferences/com.velmora.da.plist", "Network"), cf::Value::Bool(true));
+  EXPECT_TRUE(PrefIn("Library/Preferences/com.velmora.da.plist", "Power").IsNull());
+
+  r = Tallyrun({"-d"});
+  EXPECT_EQ(Count(r.err, "<default>: Day unchanged since last run\n"), 1u);
+  EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
+  EXPECT_EQ(Logs().size(), 1u);
+}
+
 TEST_F(Tasking, AGroupSwitchedOffByTaskingLeavesTheReportAndComesBack) {
   Schedule("T1", cf::Array({Entry("com.velmora.da", "mobile", "Power", cf::Value::Bool(false))}));
   Tallyrun({"-f"});  // the report comes before the tasking: still complete
