@@ -4,6 +4,7 @@
 #include <string>
 #include <vector>
 
+#include "cf/plist.h"
 #include "driver/driver.h"
 #include "platform/diagnostics.h"
 #include "platform/log.h"
@@ -65,6 +66,24 @@ void ProcessAll(const cf::Value& payload, Action action, DomainSet& touched) {
     for (const cf::Value& entry : *entries) Process(entry, action, touched);
 }
 
+// The entries of a new payload that can be applied and kept: one that no
+// preference file could hold is skipped here, so that the payload stored
+// for a later withdrawal is complete and holds only what was applied.
+cf::Value UsableEntries(const cf::Value& payload) {
+  const cf::Array* entries = payload.AsArray();
+  if (!entries) return payload;
+  cf::Array usable;
+  for (const cf::Value& entry : *entries) {
+    std::string scratch, why;
+    if (entry.AsDictionary() && !cf::WriteXMLPropertyList(entry, scratch, &why)) {
+      LogError("Skipping a tasking entry that no preference file can hold: %s", why);
+      continue;
+    }
+    usable.Append(entry);
+  }
+  return usable;
+}
+
 }  // namespace
 
 void UpdateTasking() {
@@ -111,7 +130,7 @@ void UpdateTasking() {
   }
 
   // 5. Apply the new payload.
-  const cf::Value payload = s->Get("TaskingPayload");
+  const cf::Value payload = UsableEntries(s->Get("TaskingPayload"));
   if (!payload.IsNull()) {
     ProcessAll(payload, Action::kApply, touched);
     DGVPreferencesSetValue("TaskingID", new_id, kTallyrunDomain);

@@ -152,13 +152,11 @@ TEST_F(Tasking, AValueNoPreferenceFileCanHoldPoisonsNothing) {
   ASSERT_TRUE(platform::WriteFileAtomically(root / "var/diagvault/config/com.velmora.OTAFerrowin.plist", bytes));
 
   RunResult r = Tallyrun({"-d"});
-  EXPECT_EQ(Count(r.err, "<error>: Not setting preference Power of domain com.velmora.da: string cannot be written to "
-                         "a property list: control character U+0001 at byte 2\n"),
+  EXPECT_EQ(Count(r.err, "<error>: Skipping a tasking entry that no preference file can hold: string cannot be "
+                         "written to a property list: control character U+0001 at byte 2\n"),
             1u)
       << r.err;
-  EXPECT_EQ(Count(r.err, "<error>: Not setting preference TaskingPayload of domain com.velmora.tallybookd.tallyrun: "
-                         "string cannot be written to a property list: control character U+0001 at byte 2\n"),
-            1u);
+  EXPECT_EQ(Count(r.err, "Not setting preference"), 0u);
   EXPECT_EQ(Count(r.err, "Could not write preferences domain"), 0u);
   EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
   EXPECT_EQ(Pref("TaskingID"), cf::Value("T1"));
@@ -167,10 +165,18 @@ TEST_F(Tasking, AValueNoPreferenceFileCanHoldPoisonsNothing) {
   EXPECT_EQ(PrefIn("Library/Preferences/com.velmora.da.plist", "Network"), cf::Value::Bool(true));
   EXPECT_TRUE(PrefIn("Library/Preferences/com.velmora.da.plist", "Power").IsNull());
 
+  // What was applied is what is kept, so a later tasking withdraws it.
+  EXPECT_EQ(Pref("TaskingPayload"),
+            cf::Value(cf::Array({Entry("com.velmora.da", "mobile", "Network", cf::Value::Bool(true))})));
+
   r = Tallyrun({"-d"});
   EXPECT_EQ(Count(r.err, "<default>: Day unchanged since last run\n"), 1u);
   EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
   EXPECT_EQ(Logs().size(), 1u);
+
+  Schedule("T2", cf::Array());
+  Tallyrun({"-f"});
+  EXPECT_TRUE(PrefIn("Library/Preferences/com.velmora.da.plist", "Network").IsNull());
 }
 
 TEST_F(Tasking, AGroupSwitchedOffByTaskingLeavesTheReportAndComesBack) {
