@@ -18,13 +18,10 @@ namespace {
 // Step 1: the disk's capacity and free space in MiB, -1 where unknown.
 void CollectDiskUsage() {
   const cf::Value usage = DVCopyAnswer(kDVQDiskUsage);
-  const cf::Dictionary* d = usage.AsDictionary();
-  auto mib = [&](const char* entry) {
-    const cf::Number* n = d ? d->Get(entry).AsNumber() : nullptr;
-    return n ? n->AsSInt64() >> 20 : int64_t{-1};
-  };
-  TBClientSetValueForScalarKey("com.velmora.homedeck.DiskUsageUserTotalBlocks", mib(kDVQDiskUsageTotalDiskCapacity));
-  TBClientSetValueForScalarKey("com.velmora.homedeck.DiskUsageUserBlocksFree", mib(kDVQDiskUsageTotalDataAvailable));
+  TBClientSetValueForScalarKey("com.velmora.homedeck.DiskUsageUserTotalBlocks",
+                               DiskUsageMiB(usage, kDVQDiskUsageTotalDiskCapacity));
+  TBClientSetValueForScalarKey("com.velmora.homedeck.DiskUsageUserBlocksFree",
+                               DiskUsageMiB(usage, kDVQDiskUsageTotalDataAvailable));
 }
 
 // Step 2: the storage structured log. (A seam until the storage log is built.)

@@ -35,13 +35,6 @@ std::optional<int32_t> S32(const cf::Dictionary& d, const std::string& key) {
   return n->AsSInt32();
 }
 
-// A "DiskUsage" entry in MiB (bytes shifted right by 20), or -1.
-int64_t DiskUsageMiB(const cf::Value& usage, const char* entry) {
-  const cf::Dictionary* d = usage.AsDictionary();
-  const cf::Number* n = d ? d->Get(entry).AsNumber() : nullptr;
-  return n ? n->AsSInt64() >> 20 : -1;
-}
-
 int64_t WeeksSince2000(int32_t t) {
   if (static_cast<uint32_t>(t) <= 946684800u) return 0;
   return (static_cast<int64_t>(t) - 946684800) / 604800;

@@ -169,6 +169,12 @@ cf::Value DVCopyAnswer(std::string_view question) {
   return usage;
 }
 
+int64_t DiskUsageMiB(const cf::Value& answer, const char* entry) {
+  const cf::Dictionary* d = answer.AsDictionary();
+  const cf::Number* n = d ? d->Get(entry).AsNumber() : nullptr;
+  return n ? n->AsSInt64() >> 20 : -1;
+}
+
 namespace {
 // A boolean answer (a boolean or a number), or the default when absent.
 bool BoolAnswer(std::string_view question, bool absent) {

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <functional>
+#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -44,6 +45,9 @@ cf::Value DVCopyAnswer(std::string_view question);
 inline constexpr const char* kDVQDiskUsage = "DiskUsage";
 inline constexpr const char* kDVQDiskUsageTotalDiskCapacity = "TotalDiskCapacity";
 inline constexpr const char* kDVQDiskUsageTotalDataAvailable = "TotalDataAvailable";
+// An entry of the "DiskUsage" answer in whole MiB (bytes shifted right by
+// 20), or -1 when the answer or the entry is missing.
+int64_t DiskUsageMiB(const cf::Value& answer, const char* entry);
 
 // Appends one record as a JSON line {"time", "type", "record"} (data in
 // base64) to $ROOT/var/faultkeep/structured_<YYYY-MM-DD>.jsonl, dated by the
