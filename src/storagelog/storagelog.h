@@ -1,0 +1,33 @@
+// The storage structured log: the controller's write amplification, its
+// diagnostic lists (band validity, telemetry, defects) sent to the
+// structured-data log, and the "StorageStatus" log for submission, written
+// at most once a week while the write amplification is high.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "cf/value.h"
+
+// Fetches and hands out every list the controller kind can give; false when
+// the controller cannot be reached or a list or its handler failed.
+bool DumpStorageStructuredLog(bool verbose);
+
+// A list handler: the list's bytes, the controller characteristics and the
+// controller kind's class name. False when the bytes cannot be read.
+using StorageListHandler = bool (*)(const uint8_t* data, size_t size, const cf::Value& characteristics,
+                                    std::string_view class_name);
+
+bool ParseValidityList(const uint8_t* data, size_t size, const cf::Value& characteristics,
+                       std::string_view class_name);
+bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& characteristics,
+                      std::string_view class_name);
+
+// The NAND info keys (without the version keys) added to target.
+void DumpNANDInfo(cf::Dictionary& target);
+// One "StorageStatus" log unless one was written in the last seven days.
+void NLW_WriteLog(std::string_view bug_type, const cf::Value& values);
+// The device's key for crash reports, or "error".
+std::string GetFaultkeepKey();
