@@ -10,6 +10,7 @@
 #include "platform/log.h"
 #include "platform/store.h"
 #include "platform/system.h"
+#include "storagelog/storagelog.h"
 
 using platform::LogDefault;
 
@@ -24,8 +25,8 @@ void CollectDiskUsage() {
                                DiskUsageMiB(usage, kDVQDiskUsageTotalDataAvailable));
 }
 
-// Step 2: the storage structured log. (A seam until the storage log is built.)
-void CollectStorageStructuredLog() {}
+// Step 2: the storage structured log; its failures are its own to report.
+void CollectStorageStructuredLog() { DumpStorageStructuredLog(false); }
 
 // Step 3: every number of the NAND info dictionary, merged with the memory
 // freezer's writes, becomes today's scalar of its key.

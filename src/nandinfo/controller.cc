@@ -32,8 +32,6 @@ struct FtlCache {
 };
 FtlCache g_ftl_cache;
 
-void PutU32(uint8_t* at, uint32_t v) { std::memcpy(at, &v, 4); }  // little-endian hosts only
-void PutU64(uint8_t* at, uint64_t v) { std::memcpy(at, &v, 8); }
 
 }  // namespace
 
@@ -161,6 +159,15 @@ void closeVSPConnection(VSPConnection* c) {
   c->service = 0;
 }
 
+void EncodeTunnelCommand(const tunnel_command_t& command, uint8_t out[24]) {
+  // Little-endian hosts only: the words go out in host order.
+  std::memcpy(out, &command.command, 4);
+  std::memcpy(out + 4, &command.phase, 4);
+  std::memcpy(out + 8, &command.index, 4);
+  std::memcpy(out + 12, &command.sizeHint, 4);
+  std::memcpy(out + 16, &command.bufferAddress, 8);
+}
+
 bool executeTunnelCommand(io_connect_t connection, const nand_exporter_t* exporter,
                           const tunnel_selectors_t* selectors, tunnel_command_t* command, TunnelBuffer* buffer,
                           size_t* size) {
@@ -177,15 +184,8 @@ bool executeTunnelCommand(io_connect_t connection, const nand_exporter_t* export
   }
   command->sizeHint = static_cast<uint32_t>(*size);
   command->bufferAddress = reinterpret_cast<uint64_t>(buffer);
-  // The record goes out little-endian whatever the struct's layout.
   uint8_t input[24];
-  auto encode = [&] {
-    PutU32(input, command->command);
-    PutU32(input + 4, command->phase);
-    PutU32(input + 8, command->index);
-    PutU32(input + 12, command->sizeHint);
-    PutU64(input + 16, command->bufferAddress);
-  };
+  auto encode = [&] { EncodeTunnelCommand(*command, input); };
   const size_t input_size = selectors ? sizeof input : 0;
   if (selectors) {
     command->command = selectors->sizeCommand;

@@ -67,6 +67,8 @@ struct tunnel_command_t {
   uint64_t bufferAddress;
 };
 static_assert(sizeof(tunnel_command_t) == 24);
+// The record as it goes on the wire, little-endian whatever the layout.
+void EncodeTunnelCommand(const tunnel_command_t& command, uint8_t out[24]);
 
 struct VSPConnection {
   io_service_t service;

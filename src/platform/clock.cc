@@ -132,4 +132,12 @@ uint64_t SystemClock::MonotonicNanos() {
 double Now() { return Context::Current().clock().Now(); }
 uint64_t MonotonicNanos() { return Context::Current().clock().MonotonicNanos(); }
 
+std::string LocalStamp(double t, const char* format) {
+  const time_t secs = static_cast<time_t>(std::floor(t));
+  struct tm tm;
+  localtime_r(&secs, &tm);
+  char buf[128];
+  return std::string(buf, std::strftime(buf, sizeof buf, format, &tm));
+}
+
 }  // namespace platform

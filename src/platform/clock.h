@@ -3,6 +3,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <string>
 #include <string_view>
 
 namespace platform {
@@ -67,6 +68,9 @@ std::optional<double> ParseInstant(std::string_view text);
 // Civil calendar arithmetic (proleptic Gregorian), days relative to 1970-01-01.
 int64_t DaysFromCivil(int64_t year, unsigned month, unsigned day);
 void CivilFromDays(int64_t days, int64_t* year, unsigned* month, unsigned* day);
+
+// The local time of t (epoch seconds) as strftime writes it with format.
+std::string LocalStamp(double t, const char* format);
 
 // Shorthands over the current context's clock.
 double Now();

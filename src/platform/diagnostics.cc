@@ -9,9 +9,12 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cmath>
 #include <cstring>
 #include <ctime>
+#include <fstream>
+#include <random>
 #include <vector>
 
 #include "cf/plist.h"
@@ -20,6 +23,7 @@
 #include "platform/files.h"
 #include "platform/log.h"
 #include "platform/profile.h"
+#include "platform/service.h"
 #include "platform/store.h"
 
 namespace platform {
@@ -38,15 +42,6 @@ class StringOutput : public LogOutput {
  private:
   std::string bytes_;
 };
-
-std::string LocalStamp(double t, const char* format) {
-  const time_t secs = static_cast<time_t>(std::floor(t));
-  struct tm tm;
-  localtime_r(&secs, &tm);
-  char buf[64];
-  std::strftime(buf, sizeof buf, format, &tm);
-  return buf;
-}
 
 struct Entry {
   std::string name;
@@ -153,6 +148,57 @@ std::string DGVOSVersion() {
                                : !release["VERSION_CODENAME"].empty() ? release["VERSION_CODENAME"]
                                                                       : "unknown";
   return version_id + " (" + build_id + ")";
+}
+
+namespace {
+// The first line of a small host file, without surrounding blanks; empty
+// when the file is missing or says nothing.
+std::string FirstLineOf(const char* path) {
+  std::ifstream in(path);
+  std::string line;
+  if (!in || !std::getline(in, line)) return {};
+  const size_t begin = line.find_first_not_of(" \t\r");
+  if (begin == std::string::npos) return {};
+  return line.substr(begin, line.find_last_not_of(" \t\r") + 1 - begin);
+}
+
+// A non-empty string answer, else the host's file, else "unknown".
+std::string AnswerOrHostFact(std::string_view question, const char* host_path, std::string* source) {
+  const cf::Value answer = DVCopyAnswer(question);
+  if (const std::string* s = answer.AsString(); s && !s->empty()) {
+    *source = "answers";
+    return *s;
+  }
+  std::string fact = FirstLineOf(host_path);
+  if (fact.empty()) return "unknown";
+  *source = std::strrchr(host_path, '/') + 1;
+  return fact;
+}
+}  // namespace
+
+std::string GetSysIDWithDescription(bool with_description) {
+  std::string source;
+  const std::string id = AnswerOrHostFact("SysID", "/etc/machine-id", &source);
+  return with_description && !source.empty() ? id + " (" + source + ")" : id;
+}
+
+std::string GetHardwareModel() {
+  std::string source;
+  return AnswerOrHostFact("HardwareModel", "/sys/class/dmi/id/product_name", &source);
+}
+
+std::string GetSystemVersion() { return DGVOSVersion(); }
+
+std::string GetIncidentID() {
+  std::array<uint8_t, 16> bytes{};
+  std::random_device random;
+  for (size_t i = 0; i < bytes.size(); i += 4) {
+    const uint32_t r = random();
+    std::memcpy(&bytes[i], &r, 4);
+  }
+  bytes[6] = (bytes[6] & 0x0F) | 0x40;  // version 4
+  bytes[8] = (bytes[8] & 0x3F) | 0x80;  // the usual variant
+  return uuid_unparse(bytes);
 }
 
 cf::Value DVCopyAnswer(std::string_view question) {

@@ -49,6 +49,18 @@ inline constexpr const char* kDVQDiskUsageTotalDataAvailable = "TotalDataAvailab
 // 20), or -1 when the answer or the entry is missing.
 int64_t DiskUsageMiB(const cf::Value& answer, const char* entry);
 
+// The facts of a storage log's header, as the crash-report support library
+// gives them. The system id: "SysID" of $ROOT/device/answers.plist, else
+// /etc/machine-id, else "unknown"; with a description, followed by where it
+// came from (" (answers)" or " (machine-id)").
+std::string GetSysIDWithDescription(bool with_description);
+// "HardwareModel" of answers.plist, else the DMI product name, else "unknown".
+std::string GetHardwareModel();
+// The system version as DGVOSVersion gives it.
+std::string GetSystemVersion();
+// A fresh random (version 4) UUID in upper case, one per incident.
+std::string GetIncidentID();
+
 // Appends one record as a JSON line {"time", "type", "record"} (data in
 // base64) to $ROOT/var/faultkeep/structured_<YYYY-MM-DD>.jsonl, dated by the
 // platform clock in local time. False (with an error line) when it cannot.

@@ -25,7 +25,10 @@ const std::map<std::string, uint64_t>& Known() {
       {"hostWrites", 1843261440},
       {"nandReads", 3120455680},
       {"nandWrites", 2480128000},
-      {"bandErases", 81234},
+      // A write amplification of 2.30, above the default threshold of 2.
+      {"bandErases", 690000},
+      {"pagesPerVirtualBlockSlc", 512},
+      {"intermediateBandErases", 41000},
       {"numFreeVirtualBlocks", 512},
       {"wearLevMoves", 3410},
       {"utilFormatTime", 1735689600},  // 2025-01-01
@@ -95,6 +98,31 @@ cf::Dictionary Entry(std::initializer_list<std::pair<const char*, cf::Value>> en
   return d;
 }
 
+cf::Dictionary Numbers(std::initializer_list<std::pair<const char*, int64_t>> entries) {
+  cf::Dictionary d;
+  for (const auto& [k, v] : entries) d.Set(k, cf::Value::SInt64(v));
+  return d;
+}
+
+// Valid pages per band in three of the lists, and one entry of a list
+// number that is never reported.
+cf::Dictionary ValidityList() {
+  const std::pair<int64_t, int64_t> entries[] = {{0, 1200}, {0, 1180}, {2, 17}, {2, 4}, {2, 9}, {5, 640}, {16, 1}};
+  cf::Array list;
+  for (const auto& [number, value] : entries) list.Append(Numbers({{"list", number}, {"value", value}}));
+  return Entry({{"extra", cf::Value::SInt64(2)}, {"entries", list}});
+}
+
+// Eleven factory defects and two grown ones, one retired by a program
+// failure (mode 1) and one by an erase failure (mode 2).
+cf::Dictionary DefectsList() {
+  return Entry({{"factoryCount", cf::Value::SInt64(11)},
+                {"defects", cf::Array({Numbers({{"Bus", 0}, {"CE", 1}, {"CAU", 2}, {"Block", 812}, {"Cycle", 143},
+                                                {"Reason", 7}, {"Page", 96}, {"Temperature", 41}, {"mode", 1}}),
+                                       Numbers({{"Bus", 1}, {"CE", 0}, {"CAU", 1}, {"Block", 2050}, {"Cycle", 151},
+                                                {"Reason", 3}, {"Page", 0}, {"Temperature", -4}, {"mode", 2}})})}});
+}
+
 }  // namespace
 
 DefaultDevice DefaultStorageDevice() {
@@ -112,7 +140,10 @@ DefaultDevice DefaultStorageDevice() {
              {"userClient", "nvme"},
              {"properties", Entry({{"Controller Characteristics", characteristics}})}}),
   });
-  device.controller = Entry({{"stats", FtlFields()}, {"msp", cf::Array({MspFields(0), MspFields(1)})}});
+  device.controller = Entry({{"stats", FtlFields()},
+                             {"msp", cf::Array({MspFields(0), MspFields(1)})},
+                             {"bandStats", ValidityList()},
+                             {"defects", DefectsList()}});
   device.stackshot = cf::Array({
       Entry({{"name", "kernel_task"},
              {"threads", cf::Array({Entry({{"name", "VM_swapout"}, {"diskWrites", cf::Value::UInt64(2147483648)}}),
@@ -122,6 +153,16 @@ DefaultDevice DefaultStorageDevice() {
   });
   device.purgeable = Entry({{"PURGEWELL_TOTAL_AVAILABLE", cf::Value::SInt64(6442450944)},
                             {"PURGEWELL_NONPURGEABLE_AMOUNT", cf::Value::SInt64(91268055040)}});
+  // Two corrected read errors and one with no registers captured.
+  device.ecc_events = cf::Array({
+      Entry({{"id", cf::Value::SInt64(3)},
+             {"count", cf::Value::SInt64(2)},
+             {"reg", cf::Array({cf::Value::SInt64(0x1F400), cf::Value::SInt64(-1)})}}),
+      Entry({{"id", cf::Value::SInt64(3)},
+             {"count", cf::Value::SInt64(3)},
+             {"reg", cf::Array({cf::Value::SInt64(0x2A000), cf::Value::SInt64(7), cf::Value::SInt64(0)})}}),
+      Entry({{"id", cf::Value::SInt64(9)}, {"count", cf::Value::SInt64(0)}}),
+  });
   // Its first digit decides the analytics days: 7 is odd, so odd days (in
   // UTC) send the full views and even days write the store's NAND keys.
   device.boot_session_uuid = "7E3C1F0A-5B2D-4C8E-9A61-2F4D8B0C3E95";

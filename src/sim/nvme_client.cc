@@ -9,6 +9,7 @@
 
 #include "sim/device.h"
 #include "sim/statistics_buffers.h"
+#include "sim/storage_lists.h"
 #include "sim/user_clients.h"
 
 namespace sim {
@@ -114,6 +115,9 @@ class NvmeClient : public UserClient {
     if (const cf::Dictionary* fields = answer.AsDictionary()) {
       if (command == 13) encoded = EncodeFtlFields(*fields, &error);
       else if (command == 221) encoded = EncodeMspFields(*fields, &error);
+      else if (command == 11) encoded = EncodeValidityList(*fields, &error);
+      else if (command == 15) encoded = EncodeDefectsList(*fields, &error);
+      else if (command == 17) encoded = EncodeTelemetryList(*fields, &error);
       else error = "only raw data is understood here";
     } else {
       error = "expected data or a dictionary of fields, not " + cf::TypeNameWithArticle(answer.type());

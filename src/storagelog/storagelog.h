@@ -31,3 +31,8 @@ void DumpNANDInfo(cf::Dictionary& target);
 void NLW_WriteLog(std::string_view bug_type, const cf::Value& values);
 // The device's key for crash reports, or "error".
 std::string GetFaultkeepKey();
+
+namespace storagelog::testing {
+// Sets what the last DumpStorageStructuredLog measured.
+void SetWriteAmplification(double user, double intermediate, bool above_threshold);
+}  // namespace storagelog::testing

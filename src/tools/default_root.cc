@@ -187,6 +187,8 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
   cf::Dictionary answers;
   answers.Set("DiagnosticLogSubmissionEnabled", cf::Value::Bool(true));
   answers.Set("InternalBuild", cf::Value::Bool(false));
+  answers.Set("HardwareModel", "BX12,3");
+  answers.Set("InverseDeviceID", "5d0c4e1a9b7f42e8a3c61f0b8e2d7a94");
   answers.Set("SystemLanguages", cf::Array({cf::Value("en"), cf::Value("de"), cf::Value("fr"), cf::Value("ja")}));
   if (!WritePlist(c.Path("/device/answers.plist"), answers, error)) return false;
   cf::Dictionary version;
@@ -201,7 +203,8 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
       !WritePlist(c.Path("/device/registry.plist"), device.registry, error) ||
       !WritePlist(c.Path("/device/controller.plist"), device.controller, error) ||
       !WritePlist(c.Path("/device/stackshot.plist"), device.stackshot, error) ||
-      !WritePlist(c.Path("/device/purgeable.plist"), device.purgeable, error))
+      !WritePlist(c.Path("/device/purgeable.plist"), device.purgeable, error) ||
+      !WritePlist(c.Path("/device/ecc-events.plist"), device.ecc_events, error))
     return false;
   if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
   if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), cf::Array({cf::Value("com.velmora.homedeck.appInstalls")}),
