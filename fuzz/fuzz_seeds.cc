@@ -6,7 +6,9 @@
 
 #include "cf/plist.h"
 #include "platform/service.h"
+#include "sim/default_device.h"
 #include "sim/kcdata.h"
+#include "sim/storage_lists.h"
 #include "sim/statistics_buffers.h"
 
 namespace {
@@ -112,6 +114,16 @@ int main(int argc, char** argv) {
   for (uint64_t id = 1; id <= 70; ++id) deep.Begin(id);
   deep.ThreadName("VM_swapout").IOStats(64);
   Seed("kcdata", "deep", deep.bytes());
+
+  // The controller's lists, from the default device's descriptions.
+  const sim::DefaultDevice device = sim::DefaultStorageDevice();
+  const cf::Dictionary& lists = *device.controller.AsDictionary();
+  const std::string validity = *sim::EncodeValidityList(*lists.Get("bandStats").AsDictionary(), nullptr);
+  Seed("validity", "default", validity);
+  Seed("validity", "one-byte-short", validity.substr(0, validity.size() - 1));
+  const std::string defects = *sim::EncodeDefectsList(*lists.Get("defects").AsDictionary(), nullptr);
+  Seed("defects", "default", std::string(1, '\0') + defects);
+  Seed("defects", "storage-kind-cut", std::string(1, '\1') + defects.substr(0, defects.size() - 5));
 
   // Registries: a controller under a parent, a parent loop, a bad entry; and
   // the same files as a controller's answers.

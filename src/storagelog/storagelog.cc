@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cinttypes>
 #include <cmath>
 #include <cstdio>
@@ -180,11 +181,24 @@ bool DumpStorageStructuredLog(bool verbose) {
   return result;
 }
 
-bool ParseValidityList(const uint8_t* data, size_t size, const cf::Value&, std::string_view) {
-  if (!g_amplification.above_threshold) return true;
+std::optional<std::array<cf::Array, 16>> ValidityValues(const uint8_t* data, size_t size) {
   const uint64_t count = size >= 8 ? ReadU32(data, 0) : 0;
   const uint64_t extra = size >= 8 ? ReadU32(data, 4) : 0;
-  if (count == 0 || size < 4 * (2 + 2 * extra + 5 * count)) {
+  if (count == 0 || size < 4 * (2 + 2 * extra + 5 * count)) return std::nullopt;
+  std::array<cf::Array, 16> lists;
+  const size_t entries = 8 + 8 * extra;
+  for (uint64_t e = 0; e < count; ++e) {
+    const size_t at = entries + 20 * e;
+    const uint32_t list = ReadU32(data, at + 4);
+    if (list < lists.size()) lists[list].Append(cf::Value::SInt32(static_cast<int32_t>(ReadU32(data, at + 8))));
+  }
+  return lists;
+}
+
+bool ParseValidityList(const uint8_t* data, size_t size, const cf::Value&, std::string_view) {
+  if (!g_amplification.above_threshold) return true;
+  const std::optional<std::array<cf::Array, 16>> lists = ValidityValues(data, size);
+  if (!lists) {
     std::fputs("data cannot be parsed\n", stderr);
     return false;
   }
@@ -192,35 +206,25 @@ bool ParseValidityList(const uint8_t* data, size_t size, const cf::Value&, std::
   values.Set("IntermediateWamp", cf::Value::Float64(g_amplification.intermediate));
   values.Set("UserWamp", cf::Value::Float64(g_amplification.user));
   DumpNANDInfo(values);
-  std::vector<cf::Array> lists(16);
-  const size_t entries = 8 + 8 * extra;
-  for (uint64_t e = 0; e < count; ++e) {
-    const size_t at = entries + 20 * e;
-    const uint32_t list = ReadU32(data, at + 4);
-    if (list < lists.size()) lists[list].Append(cf::Value::SInt32(static_cast<int32_t>(ReadU32(data, at + 8))));
-  }
-  for (size_t d = 0; d < lists.size(); ++d)
-    if (!lists[d].empty()) values.Set("ValidityList[" + std::to_string(d) + "]", lists[d]);
+  for (size_t d = 0; d < lists->size(); ++d)
+    if (!(*lists)[d].empty()) values.Set("ValidityList[" + std::to_string(d) + "]", (*lists)[d]);
   NLW_WriteLog("165", values);
   return true;
 }
 
-bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& characteristics,
-                      std::string_view class_name) {
-  if (size < 12) {
-    std::fputs("data cannot be parsed\n", stderr);
-    return false;
-  }
-  cf::Dictionary header;
+std::optional<std::vector<cf::Dictionary>> DefectRecords(const uint8_t* data, size_t size,
+                                                         const cf::Value& characteristics,
+                                                         std::string_view class_name) {
+  if (size < 12) return std::nullopt;
+  std::vector<cf::Dictionary> records(1);
+  cf::Dictionary& header = records[0];
   header.Set("Factory Count", cf::Value::SInt32(static_cast<int32_t>(ReadU32(data, 4))));
   if (const cf::Dictionary* c = characteristics.AsDictionary())
     if (const cf::Number* desc = c->Get("nand-device-desc").AsNumber())
       header.Set("com.velmora.NANDInfo.nandDesc", cf::Value::SInt32(desc->AsSInt32()));
-  FKLogStructuredData(176, header);
-
-  const uint64_t claimed = ReadU32(data, 8);
-  const uint64_t fit = (size - 12) / 32;
-  for (uint64_t e = 0; e < std::min(claimed, fit); ++e) {
+  // Entries go as far as the bytes do, whatever the count claims.
+  const uint64_t count = std::min<uint64_t>(ReadU32(data, 8), (size - 12) / 32);
+  for (uint64_t e = 0; e < count; ++e) {
     const uint8_t* entry = data + 12 + 32 * e;
     auto word = [&](size_t w) { return ReadU32(entry, 4 * w); };
     uint32_t reason = word(4);
@@ -232,7 +236,7 @@ bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& charact
         default: std::fprintf(stderr, "Encountered unexpected defectMode: 0x%x\n", mode);
       }
     }
-    cf::Dictionary defect;
+    cf::Dictionary& defect = records.emplace_back();
     auto set = [&](const char* key, uint32_t v) { defect.Set(key, cf::Value::SInt32(static_cast<int32_t>(v))); };
     set("Bus", word(0) & 0xFFFF);
     set("CE", word(0) >> 16);
@@ -242,8 +246,18 @@ bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& charact
     set("Reason", reason);
     set("Page", word(5));
     defect.Set("Temperature", cf::Number::SInt8(static_cast<int8_t>(word(6) & 0xFF)));
-    FKLogStructuredData(176, defect);
   }
+  return records;
+}
+
+bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& characteristics,
+                      std::string_view class_name) {
+  const std::optional<std::vector<cf::Dictionary>> records = DefectRecords(data, size, characteristics, class_name);
+  if (!records) {
+    std::fputs("data cannot be parsed\n", stderr);
+    return false;
+  }
+  for (const cf::Dictionary& record : *records) FKLogStructuredData(176, record);
   return true;
 }
 

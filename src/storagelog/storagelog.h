@@ -4,10 +4,13 @@
 // at most once a week while the write amplification is high.
 #pragma once
 
+#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <string>
 #include <string_view>
+#include <optional>
+#include <vector>
 
 #include "cf/value.h"
 
@@ -24,6 +27,16 @@ bool ParseValidityList(const uint8_t* data, size_t size, const cf::Value& charac
                        std::string_view class_name);
 bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& characteristics,
                       std::string_view class_name);
+
+// The lists' readers, without effects. The values of each list number 0 to
+// 15 in entry order (other numbers dropped), or nothing when the list has no
+// entries or is shorter than it claims.
+std::optional<std::array<cf::Array, 16>> ValidityValues(const uint8_t* data, size_t size);
+// The defects list's records: its header, then one per entry that fits;
+// nothing when the header itself does not.
+std::optional<std::vector<cf::Dictionary>> DefectRecords(const uint8_t* data, size_t size,
+                                                         const cf::Value& characteristics,
+                                                         std::string_view class_name);
 
 // The NAND info keys (without the version keys) added to target.
 void DumpNANDInfo(cf::Dictionary& target);
