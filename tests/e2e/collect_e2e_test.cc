@@ -1,5 +1,5 @@
 // The daily collection's own keys and records through whole runs: disk
-// usage and the kernel's ECC events.
+// usage, the kernel's ECC events and the storage structured log.
 #include "../test_values.h"
 #include "root_fixture.h"
 
@@ -12,14 +12,15 @@ class CollectRun : public RootTest {
     const size_t at = dump.out.find(key + " ");
     return at == std::string::npos ? "(missing)" : dump.out.substr(at + key.size() + 1, dump.out.find('\n', at) - at - key.size() - 1);
   }
-  std::vector<cf::Dictionary> EccRecords() {
+  std::vector<cf::Dictionary> EccRecords() { return Records(172); }
+  std::vector<cf::Dictionary> Records(int type) {
     std::vector<cf::Dictionary> out;
     const std::string text = platform::ReadFile(root / "var/faultkeep/structured_2026-11-22.jsonl").value_or("");
     for (size_t start = 0; start < text.size();) {
       const size_t end = text.find('\n', start);
       const cf::Value line = cf::ParseJSON(text.substr(start, end - start)).value;
       start = end + 1;
-      if (line.AsDictionary() && line.AsDictionary()->Get("type") == cf::Value::SInt32(172))
+      if (line.AsDictionary() && line.AsDictionary()->Get("type") == cf::Value::SInt32(type))
         out.push_back(*line.AsDictionary()->Get("record").AsDictionary());
     }
     return out;
@@ -70,6 +71,34 @@ TEST_F(CollectRun, EccEventsTenARunEachReadOnce) {
   r = Tallyrun({"-f"});
   EXPECT_EQ(Count(r.err, "Unexpected errno"), 0u);
   EXPECT_EQ(EccRecords().size(), 11u);
+}
+
+TEST_F(CollectRun, TheDefaultDeviceGivesItsStorageRecordsAndAWeeklyStatusLog) {
+  auto status_logs = [&] {
+    std::vector<std::string> out;
+    for (const auto& e : std::filesystem::directory_iterator(root / "var/diagvault/submissions"))
+      if (e.path().extension() == ".165") out.push_back(platform::ReadFile(e.path()).value_or(""));
+    return out;
+  };
+  RunResult r = Tallyrun({"-f"});
+  auto logs = status_logs();
+  ASSERT_EQ(logs.size(), 1u) << r.err;
+  EXPECT_NE(logs[0].find(";UserWamp:2.30;"), std::string::npos) << logs[0];
+  EXPECT_NE(logs[0].find(";ValidityList[2]:17,4,9;"), std::string::npos);
+  EXPECT_EQ(EccRecords().size(), 3u);
+  const auto storage = Records(176);
+  size_t defects = 0;
+  for (const cf::Dictionary& d : storage) defects += d.Find("Reason") != nullptr;
+  EXPECT_EQ(defects, 2u);
+  EXPECT_EQ(Count(r.err, "not supported"), 0u) << r.err;
+
+  // The same week: the lists are fetched again, the log is not.
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(status_logs().size(), 1u);
+  EXPECT_EQ(Count(r.err, "NANDLogWriter:Last written at 2026-11-22 15:00:00 +0000 current "), 1u) << r.err;
+  env["TALLYRUN_NOW"] = "2026-11-29T15:00:00Z";
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(status_logs().size(), 2u) << r.err;
 }
 
 }  // namespace
