@@ -63,20 +63,29 @@ const cf::Array* RecordList(const cf::Dictionary& fields, const char* key, std::
   return nullptr;
 }
 
+// A list's description: one header number and an array of records under
+// list_key. The records, or null (reason in *error).
+const cf::Array* ListParts(const cf::Dictionary& fields, const std::string& what, std::string_view header_key,
+                           const char* list_key, uint32_t* header, std::string* error) {
+  cf::Dictionary top;
+  for (const auto& [key, value] : fields)
+    if (!key.AsString() || *key.AsString() != list_key) top.Set(key, value);
+  std::vector<uint32_t> words;
+  if (!RecordWords(top, what, {header_key}, &words, error)) return nullptr;
+  *header = words[0];
+  return RecordList(fields, list_key, error);
+}
+
 }  // namespace
 
 std::optional<std::string> EncodeValidityList(const cf::Dictionary& fields, std::string* error) {
-  std::vector<uint32_t> header;
-  cf::Dictionary top;
-  for (const auto& [key, value] : fields)
-    if (!key.AsString() || *key.AsString() != "entries") top.Set(key, value);
-  if (!RecordWords(top, "validity list", {"extra"}, &header, error)) return std::nullopt;
-  const cf::Array* entries = RecordList(fields, "entries", error);
+  uint32_t extra = 0;
+  const cf::Array* entries = ListParts(fields, "validity list", "extra", "entries", &extra, error);
   if (!entries) return std::nullopt;
   std::string out;
   PutU32(out, static_cast<uint32_t>(entries->size()));
-  PutU32(out, header[0]);
-  out.append(size_t{8} * header[0], '\0');
+  PutU32(out, extra);
+  out.append(size_t{8} * extra, '\0');
   std::vector<uint32_t> words;
   for (size_t i = 0; i < entries->size(); ++i) {
     if (!RecordWords((*entries)[i], "validity entry " + std::to_string(i), {"list", "value"}, &words, error))
@@ -87,16 +96,12 @@ std::optional<std::string> EncodeValidityList(const cf::Dictionary& fields, std:
 }
 
 std::optional<std::string> EncodeDefectsList(const cf::Dictionary& fields, std::string* error) {
-  std::vector<uint32_t> header;
-  cf::Dictionary top;
-  for (const auto& [key, value] : fields)
-    if (!key.AsString() || *key.AsString() != "defects") top.Set(key, value);
-  if (!RecordWords(top, "defects list", {"factoryCount"}, &header, error)) return std::nullopt;
-  const cf::Array* defects = RecordList(fields, "defects", error);
+  uint32_t factory_count = 0;
+  const cf::Array* defects = ListParts(fields, "defects list", "factoryCount", "defects", &factory_count, error);
   if (!defects) return std::nullopt;
   std::string out;
   PutU32(out, 0);
-  PutU32(out, header[0]);
+  PutU32(out, factory_count);
   PutU32(out, static_cast<uint32_t>(defects->size()));
   std::vector<uint32_t> w;
   for (size_t i = 0; i < defects->size(); ++i) {

@@ -5,6 +5,7 @@
 #include <filesystem>
 #include <thread>
 
+#include "../../tests/records.h"
 #include "../../tests/temp_dir.h"
 #include "../../tests/test_values.h"
 #include "cf/plist.h"
@@ -65,24 +66,9 @@ class StorageLogTest : public ::testing::Test {
     WriteController();
   }
 
-  std::vector<std::string> StorageStatusLogs() {
-    std::vector<std::string> out;
-    std::error_code ec;
-    for (const auto& e : std::filesystem::directory_iterator(root / "var/diagvault/submissions", ec))
-      if (e.path().extension() == ".165") out.push_back(platform::ReadFile(e.path().string()).value_or(""));
-    return out;
-  }
+  std::vector<std::string> StorageStatusLogs() { return FilesEndingIn(root / "var/diagvault/submissions", ".165"); }
   std::vector<cf::Dictionary> Records(int type) {
-    std::vector<cf::Dictionary> out;
-    const std::string text = platform::ReadFile(root / "var/faultkeep/structured_2026-11-22.jsonl").value_or("");
-    for (size_t start = 0; start < text.size();) {
-      const size_t end = text.find('\n', start);
-      const cf::Value line = cf::ParseJSON(text.substr(start, end - start)).value;
-      start = end + 1;
-      if (line.AsDictionary() && line.AsDictionary()->Get("type") == cf::Value::SInt32(type))
-        out.push_back(*line.AsDictionary()->Get("record").AsDictionary());
-    }
-    return out;
+    return StructuredRecords(root / "var/faultkeep/structured_2026-11-22.jsonl", type);
   }
 
  private:

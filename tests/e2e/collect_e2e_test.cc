@@ -1,5 +1,6 @@
 // The daily collection's own keys and records through whole runs: disk
 // usage, the kernel's ECC events and the storage structured log.
+#include "../records.h"
 #include "../test_values.h"
 #include "root_fixture.h"
 
@@ -14,16 +15,7 @@ class CollectRun : public RootTest {
   }
   std::vector<cf::Dictionary> EccRecords() { return Records(172); }
   std::vector<cf::Dictionary> Records(int type) {
-    std::vector<cf::Dictionary> out;
-    const std::string text = platform::ReadFile(root / "var/faultkeep/structured_2026-11-22.jsonl").value_or("");
-    for (size_t start = 0; start < text.size();) {
-      const size_t end = text.find('\n', start);
-      const cf::Value line = cf::ParseJSON(text.substr(start, end - start)).value;
-      start = end + 1;
-      if (line.AsDictionary() && line.AsDictionary()->Get("type") == cf::Value::SInt32(type))
-        out.push_back(*line.AsDictionary()->Get("record").AsDictionary());
-    }
-    return out;
+    return StructuredRecords(root / "var/faultkeep/structured_2026-11-22.jsonl", type);
   }
 };
 
@@ -74,12 +66,7 @@ TEST_F(CollectRun, EccEventsTenARunEachReadOnce) {
 }
 
 TEST_F(CollectRun, TheDefaultDeviceGivesItsStorageRecordsAndAWeeklyStatusLog) {
-  auto status_logs = [&] {
-    std::vector<std::string> out;
-    for (const auto& e : std::filesystem::directory_iterator(root / "var/diagvault/submissions"))
-      if (e.path().extension() == ".165") out.push_back(platform::ReadFile(e.path()).value_or(""));
-    return out;
-  };
+  auto status_logs = [&] { return FilesEndingIn(root / "var/diagvault/submissions", ".165"); };
   RunResult r = Tallyrun({"-f"});
   auto logs = status_logs();
   ASSERT_EQ(logs.size(), 1u) << r.err;
