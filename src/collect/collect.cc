@@ -3,13 +3,19 @@
 #include <errno.h>
 
 #include <algorithm>
+#include <chrono>
+#include <memory>
+#include <semaphore>
 #include <string>
+
+#include "collect/datausage.h"
 
 #include "nandinfo/nandinfo.h"
 #include "platform/diagnostics.h"
 #include "platform/log.h"
 #include "platform/store.h"
 #include "platform/system.h"
+#include "platform/usage.h"
 #include "storagelog/storagelog.h"
 
 using platform::LogDefault;
@@ -77,8 +83,18 @@ void CollectECCEvents() {
   if (failed && errno != ENOENT && errno != EBUSY) LogDefault("Unexpected errno (%d) reading ECC events from kernel", errno);
 }
 
-// Step 5: per-process network usage. (A seam until the collection work builds it.)
-void CollectDataUsage() {}
+// Step 5: per-process network usage. The reply comes on the service's
+// thread and holds its own references, so that one arriving after the wait
+// is still handled (see collect/datausage.h for what it may touch).
+void CollectDataUsage() {
+  auto workspace = std::make_shared<AnalyticsWorkspace>(kVitalisAnalyticsServiceEndpoint);
+  auto feed = std::make_shared<UsageFeed>(workspace);
+  auto done = std::make_shared<std::counting_semaphore<>>(0);
+  feed->UsageToDateFor({}, kUsageProcessProcName, [feed, workspace, done](const cf::Array& records) {
+    ProcessDataUsageReply(records, *done);
+  });
+  if (!done->try_acquire_for(std::chrono::seconds(10))) LogDefault("Vitalis timed out, no datausage available");
+}
 
 // Step 6: the reporting channels of the field category. (A seam until the
 // reporting channels are built.)

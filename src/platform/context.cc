@@ -34,6 +34,12 @@ Context& DefaultContext() {
 
 }  // namespace
 
+std::recursive_mutex& SharedStateMutex() {
+  // Never destroyed: exit handlers and late replies still take it.
+  static auto* const mutex = new std::recursive_mutex;
+  return *mutex;
+}
+
 std::string EnvOr(const char* name, const char* fallback) {
   const char* v = std::getenv(name);
   return v && *v ? std::string(v) : std::string(fallback);
@@ -49,12 +55,14 @@ Context::Context(std::string root, Backends backends)
 }
 
 Preferences& Context::PreferencesAt(const std::string& device_dir) {
+  std::lock_guard<std::recursive_mutex> lock(SharedStateMutex());
   auto& slot = preference_stores_[device_dir];
   if (!slot) slot = std::make_unique<Preferences>(Path(device_dir));
   return *slot;
 }
 
 void Context::SynchronizeAllPreferences() {
+  std::lock_guard<std::recursive_mutex> lock(SharedStateMutex());
   for (auto& [dir, prefs] : preference_stores_) prefs->SynchronizeAll();
 }
 
@@ -73,6 +81,7 @@ std::string Context::Path(std::string_view device_path) const {
 }
 
 TallyStore* Context::store(std::string* error) {
+  std::lock_guard<std::recursive_mutex> lock(SharedStateMutex());
   if (!store_ && !store_tried_) {
     store_tried_ = true;
     store_ = TallyStore::Open(Path(kStoreDevicePath), TallyStore::Mode::kCreate, &store_error_);

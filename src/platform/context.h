@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <map>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <string_view>
 
@@ -85,6 +86,15 @@ class ContextScope {
   std::unique_ptr<Context> context_;
   Context* previous_;
 };
+
+// Guards what the platform services share within the process: the store
+// client's connection (and its last error), the preference stores, and the
+// parts of the context made on first use. The system runs on the main
+// thread; the one other thread that calls the services is the usage
+// service's reply (platform/usage.h). The store client and preference calls
+// take this lock themselves; it is recursive, so that a caller may hold it
+// across several calls that another thread must not come between.
+std::recursive_mutex& SharedStateMutex();
 
 // Environment lookup with a default, shared by the backends.
 std::string EnvOr(const char* name, const char* fallback);

@@ -8,7 +8,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstring>
+#include <mutex>
 #include <random>
 #include <vector>
 
@@ -20,7 +22,8 @@ namespace platform {
 namespace testing {
 namespace {
 FaultPlan g_plan;
-uint64_t g_points = 0;
+// Files are written from the usage service's reply thread too.
+std::atomic<uint64_t> g_points{0};
 }  // namespace
 void SetFaultPlan(const FaultPlan& plan) {
   g_plan = plan;
@@ -70,6 +73,8 @@ void ApplyGroup(int fd) {
 std::string RandomSuffix() {
   static constexpr char kChars[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
   static std::mt19937_64 rng{std::random_device{}() ^ static_cast<uint64_t>(getpid())};
+  static std::mutex mu;  // temp files are made from more than one thread
+  std::lock_guard<std::mutex> lock(mu);
   std::string s(6, 'x');
   for (char& c : s) c = kChars[rng() % (sizeof kChars - 1)];
   return s;

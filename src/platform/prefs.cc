@@ -181,10 +181,12 @@ bool BoolFrom(const cf::Value& v, bool* out) {
 }  // namespace
 
 cf::Value DGVPreferencesGetValue(const cf::Value& key, std::string_view domain) {
+  std::lock_guard<std::recursive_mutex> lock(platform::SharedStateMutex());
   return Context::Current().preferences().Get(domain, key);
 }
 
 void DGVPreferencesSetValue(const cf::Value& key, const cf::Value& value, std::string_view domain) {
+  std::lock_guard<std::recursive_mutex> lock(platform::SharedStateMutex());
   Context::Current().preferences().Set(domain, key, value);
 }
 
@@ -203,6 +205,7 @@ bool DGVPreferencesGetBoolValue(const cf::Value& key, std::string_view domain, b
 }
 
 bool DGVPreferencesSynchronize(std::string_view domain) {
+  std::lock_guard<std::recursive_mutex> lock(platform::SharedStateMutex());
   return Context::Current().preferences().Synchronize(domain);
 }
 

@@ -330,6 +330,9 @@ int32_t Today() { return platform::DaysSince1970At(platform::Now()); }
 
 template <typename F>
 bool WithStore(const char* what, F&& f) {
+  // Held through a whole batch too, so that another thread's write never
+  // lands inside this thread's transaction.
+  std::lock_guard<std::recursive_mutex> lock(platform::SharedStateMutex());
   platform::TallyStore* store = Context::Current().store();
   if (!store) return false;
   if (!f(*store)) {

@@ -12,6 +12,7 @@
 #include "platform/faultkeep.h"
 #include "platform/files.h"
 #include "platform/store.h"
+#include "platform/usage.h"
 #include "sim/default_device.h"
 
 namespace {
@@ -91,6 +92,36 @@ cf::Array Apps() {
     out.Append(app);
   }
   return out;
+}
+
+// The usage service's counters: an app whose counters began today and one
+// whose began yesterday (both written whole by the first run), and a daemon
+// counting since days before (old data).
+cf::Dictionary Usage(int32_t today) {
+  struct Entry {
+    const char* bundle;
+    const char* proc;
+    int32_t since_day;
+    int64_t bytes[4];
+  };
+  const Entry entries[] = {
+      {"com.example.maps", "Maps", today, {52428800, 2097152, 10485760, 524288}},
+      {"com.example.podcasts", "Podcasts", today - 1, {734003200, 1048576, 0, 0}},
+      {nullptr, "netsyncd", today - 5, {8388608, 4194304, 1048576, 65536}},
+  };
+  cf::Array records;
+  for (const Entry& e : entries) {
+    cf::Dictionary r;
+    if (e.bundle) r.Set("bundleName", e.bundle);
+    r.Set("procName", e.proc);
+    r.Set(kUsageSinceTime, cf::Date{platform::StartOfDay(e.since_day) + 1800});
+    const char* fields[] = {"wifiInBytes", "wifiOutBytes", "wwanInBytes", "wwanOutBytes"};
+    for (int i = 0; i < 4; ++i) r.Set(fields[i], cf::Value::SInt64(e.bytes[i]));
+    records.Append(r);
+  }
+  cf::Dictionary usage;
+  usage.Set("records", records);
+  return usage;
 }
 
 cf::Dictionary Whitelist() {
@@ -207,6 +238,7 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
       !WritePlist(c.Path("/device/ecc-events.plist"), device.ecc_events, error))
     return false;
   if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
+  if (!WritePlist(c.Path(kUsageDevicePath), Usage(TBDaysSince1970()), error)) return false;
   if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), cf::Array({cf::Value("com.velmora.homedeck.appInstalls")}),
                   error))
     return false;

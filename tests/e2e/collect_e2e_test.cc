@@ -1,5 +1,6 @@
 // The daily collection's own keys and records through whole runs: disk
-// usage, the kernel's ECC events and the storage structured log.
+// usage, the kernel's ECC events, network data usage and the storage
+// structured log.
 #include "../records.h"
 #include "../test_values.h"
 #include "root_fixture.h"
@@ -16,6 +17,19 @@ class CollectRun : public RootTest {
   std::vector<cf::Dictionary> EccRecords() { return Records(172); }
   std::vector<cf::Dictionary> Records(int type) {
     return StructuredRecords(root / "var/faultkeep/structured_2026-11-22.jsonl", type);
+  }
+  // A usage service answering one process's counters, begun today at 10:00.
+  void UsageAnswer(int64_t bytes, std::initializer_list<std::pair<const char*, cf::Value>> options) {
+    cf::Dictionary answer = Dict(options);
+    cf::Dictionary record = Dict({{"procName", "P"}, {"sinceTime", cf::Date{1795341600}}});
+    for (const char* field : {"wifiInBytes", "wifiOutBytes", "wwanInBytes", "wwanOutBytes"})
+      record.Set(field, cf::Value::SInt64(bytes));
+    answer.Set("records", cf::Array({record}));
+    WritePlist("device/usage.plist", answer);
+  }
+  cf::Value Baseline() {
+    const cf::Value v = ReadPlist(root / "Library/Preferences/com.velmora.diagvault.tallyrun.plist");
+    return v.AsDictionary() ? v.AsDictionary()->Get("netUsageBaseline") : cf::Value();
   }
 };
 
@@ -86,6 +100,52 @@ TEST_F(CollectRun, TheDefaultDeviceGivesItsStorageRecordsAndAWeeklyStatusLog) {
   env["TALLYRUN_NOW"] = "2026-11-29T15:00:00Z";
   r = Tallyrun({"-f"});
   EXPECT_EQ(status_logs().size(), 2u) << r.err;
+}
+
+TEST_F(CollectRun, DataUsageOfTheDefaultRootCountsGrowthOnly) {
+  for (int run = 0; run < 2; ++run) {  // the second run sees the same counters: nothing grew
+    const RunResult r = Tallyrun({"-f"});
+    EXPECT_EQ(Scalar("datausage.wifiInKB.com.example.maps"), "51200") << r.err;
+    EXPECT_EQ(Scalar("datausage.wifiInKB.com.example.podcasts"), "716800");
+    EXPECT_EQ(Scalar("datausage.olddata.com.velmora.netsyncd"), "1");
+    EXPECT_EQ(Baseline().AsDictionary() ? Baseline().AsDictionary()->size() : 0u, 3u);
+  }
+  // No usage file: an empty answer at once, which empties the baseline.
+  std::filesystem::remove(root / "device/usage.plist");
+  EXPECT_EQ(Count(Tallyrun({"-f"}).err, "Vitalis timed out"), 0u);
+  EXPECT_EQ(Baseline(), cf::Value(cf::Dictionary()));
+}
+
+TEST_F(CollectRun, UsageServiceWithoutAnAnswerDoesNotHoldTheRun) {
+  Tallyrun({"-f"});
+  const cf::Value baseline = Baseline();
+  for (const bool malformed : {false, true}) {
+    if (malformed) WritePlist("device/usage.plist", cf::Array({cf::Value("records")}));
+    else UsageAnswer(10240, {{"neverReply", cf::Value::Bool(true)}});
+    const auto start = std::chrono::steady_clock::now();
+    const RunResult r = Tallyrun({"-f"});
+    // Liveness, not timing: the wait is bounded, so the run ends.
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(30));
+    EXPECT_EQ(Count(r.err, "<default>: Vitalis timed out, no datausage available\n"), 1u) << r.err;
+    EXPECT_EQ(Count(r.err, "<error>: The usage service cannot answer: " + root / "device/usage.plist" +
+                               " is an array, not a dictionary\n"),
+              malformed ? 1u : 0u);
+    EXPECT_EQ(Baseline(), baseline) << "no answer keeps the baseline";
+  }
+}
+
+TEST_F(CollectRun, LateRepliesStillCount) {
+  // Within the wait.
+  UsageAnswer(10240, {{"delaySeconds", cf::Value::SInt32(3)}});
+  RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("datausage.wwanOutKB.com.velmora.P"), "10") << r.err;
+  EXPECT_EQ(Count(r.err, "Vitalis timed out"), 0u);
+  // After the wait, while the service still runs: the growth is counted.
+  UsageAnswer(20480, {{"delaySeconds", cf::Value::SInt32(12)}});
+  env["TALLYRUN_SERVICE_IDLE_SECONDS"] = "8";
+  r = Serve({{"run-day", std::to_string(kToday - 1)}});
+  EXPECT_EQ(Count(r.err, "<default>: Vitalis timed out, no datausage available\n"), 1u) << r.err;
+  EXPECT_EQ(Scalar("datausage.wwanOutKB.com.velmora.P"), "20");
 }
 
 }  // namespace
