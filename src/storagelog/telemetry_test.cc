@@ -15,6 +15,7 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "sim/default_device.h"
 #include "sim/storage_lists.h"
 #include "storagelog/telemetry_layouts.h"
 
@@ -370,6 +371,32 @@ TEST(TelemetryListEncoder, WritesBlocksThenSummariesAndRefusesBadFields) {
   EXPECT_EQ(error, "unknown telemetry key \"bus\"");
   EXPECT_FALSE(encode(Dict({{"buses", Dict({})}})));
   EXPECT_EQ(error, "\"buses\": expected an array, not a dictionary");
+}
+
+TEST_F(TelemetryTest, TheDefaultControllerAnswersEveryModeForItsBuses) {
+  const sim::DefaultDevice device = sim::DefaultStorageDevice();
+  const cf::Value characteristics = (*device.registry.AsArray())[1]
+                                        .AsDictionary()
+                                        ->Get("properties")
+                                        .AsDictionary()
+                                        ->Get("Controller Characteristics");
+  const cf::Dictionary* modes = device.controller.AsDictionary()->Get("telemetry").AsDictionary();
+  ASSERT_NE(modes, nullptr);
+  for (const char* mode : {"0", "1", "2"}) {
+    SCOPED_TRACE(mode);
+    std::string error;
+    const std::optional<std::string> list = sim::EncodeTelemetryList(*modes->Get(mode).AsDictionary(), &error);
+    ASSERT_TRUE(list) << error;
+    const Outcome out = Run(*list, characteristics);
+    EXPECT_TRUE(out.ok);
+    ASSERT_EQ(out.records.size(), 2u);
+    for (const cf::Dictionary& r : out.records)
+      for (const char* key : {"readStage[0]", "initialReadStage[0]", "algoNANDAccessesBin[0]", "num_pages"})
+        EXPECT_GT(r.Get(key).AsNumber()->AsSInt64(), 0) << key;
+  }
+  // devsim init writes the lists as they are: as a property list.
+  std::string xml;
+  EXPECT_TRUE(cf::WriteXMLPropertyList(device.controller, xml, nullptr));
 }
 
 }  // namespace
