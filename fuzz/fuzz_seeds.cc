@@ -10,6 +10,7 @@
 #include "sim/kcdata.h"
 #include "sim/storage_lists.h"
 #include "sim/statistics_buffers.h"
+#include "sim/storage_lists.h"
 
 namespace {
 
@@ -188,5 +189,36 @@ int main(int argc, char** argv) {
   shared += std::string(6, '\0') + "\x02\x01" + BigEndian(2, 8) + BigEndian(0, 8) + BigEndian(table, 8);
   Seed("service_frames", "shared-string", "\xff" + length(static_cast<uint32_t>(shared.size())) + shared);
   Seed("plist", "shared-string.bplist", shared);
+
+  // Telemetry lists: a byte that picks the characteristics (chip in bits
+  // 0-1, NAND part in bits 2-4, bus count form in bits 5-7), the bus count,
+  // then the list.
+  auto telemetry_bus = [](uint32_t seed) {
+    cf::Dictionary words;
+    for (uint32_t r : {0u, 8u, 19u, 26u, 75u, 106u, 122u, 256u, 262u, 301u, 372u, 532u, 1023u})
+      words.Set(std::to_string(r), cf::Value::UInt64(r * 1000 + seed));
+    words.Set("18", cf::Value::SInt64(-1));
+    cf::Dictionary bus;
+    bus.Set("RD", cf::Value::UInt64(18000 + seed));
+    bus.Set("num_pages", cf::Value::UInt64(1536));
+    bus.Set("words", words);
+    return cf::Value(bus);
+  };
+  cf::Dictionary two_buses;
+  two_buses.Set("buses", cf::Array({telemetry_bus(1), telemetry_bus(2)}));
+  const std::string two = *sim::EncodeTelemetryList(two_buses, nullptr);
+  auto telemetry = [](uint8_t pick, uint32_t buses, const std::string& list) {
+    std::string count;
+    for (int i = 0; i < 4; ++i) count += static_cast<char>(buses >> (8 * i));
+    return std::string(1, static_cast<char>(pick)) + count + list;
+  };
+  Seed("telemetry", "k3r-two-buses", telemetry(0x00, 2, two));
+  Seed("telemetry", "k4r-two-buses", telemetry(0x01, 2, two));
+  Seed("telemetry", "first-maker-1x", telemetry(0x02 | (1 << 2), 2, two));
+  Seed("telemetry", "second-maker-1x", telemetry(0x02 | (2 << 2), 2, two));
+  Seed("telemetry", "1y-one-of-two", telemetry(0x02 | (3 << 2), 1, two));
+  Seed("telemetry", "one-byte-short", telemetry(0x00, 2, two.substr(0, two.size() - 1)));
+  Seed("telemetry", "no-buses", telemetry(0x00, 0, ""));
+  Seed("telemetry", "negative-count", telemetry(0x01, 0xFFFFFFFF, two));
   return 0;
 }

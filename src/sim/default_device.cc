@@ -1,5 +1,6 @@
 #include "sim/default_device.h"
 
+#include <iterator>
 #include <map>
 #include <string>
 
@@ -123,6 +124,35 @@ cf::Dictionary DefectsList() {
                                                 {"Reason", 3}, {"Page", 0}, {"Temperature", -4}, {"mode", 2}})})}});
 }
 
+// The read-algorithm counters of the two buses the characteristics claim,
+// in the chip's own layout: most reads done at the first stage, a few
+// needing the later ones. Each mode's list is described the same way, with
+// counts that grow a little from mode to mode.
+cf::Dictionary TelemetryFields(uint32_t mode) {
+  cf::Array buses;
+  for (uint32_t bus = 0; bus < 2; ++bus) {
+    const uint32_t scale = 1 + mode + bus;
+    cf::Dictionary words;
+    const uint32_t read_stages[] = {981234, 10422, 2210, 640, 97, 12, 3};
+    for (uint32_t i = 0; i < std::size(read_stages); ++i)
+      words.Set(std::to_string(i), cf::Value::UInt64(uint64_t{read_stages[i]} * scale));
+    words.Set("20", cf::Value::UInt64(991001 * scale));  // the first initial read stage
+    words.Set("28", cf::Value::UInt64(3));               // the stage of life
+    words.Set("45", cf::Value::UInt64(420 * scale));     // the first error bins
+    words.Set("46", cf::Value::UInt64(37 * scale));
+    words.Set("106", cf::Value::UInt64(1204 * scale));   // NAND accesses
+    buses.Append(Entry({{"RD", cf::Value::UInt64(18000 + 1000 * bus)},
+                        {"PE", cf::Value::UInt64(410 + bus)},
+                        {"Max_PE_rate", cf::Value::UInt64(3000)},
+                        {"t0", cf::Value::UInt64(1735689600)},
+                        {"Ret", cf::Value::UInt64(12)},
+                        {"block_type", cf::Value::UInt64(1)},
+                        {"num_pages", cf::Value::UInt64(1536)},
+                        {"words", words}}));
+  }
+  return Entry({{"buses", buses}});
+}
+
 }  // namespace
 
 DefaultDevice DefaultStorageDevice() {
@@ -130,7 +160,7 @@ DefaultDevice DefaultStorageDevice() {
   const cf::Dictionary characteristics = Entry({{"chip-id", "K3R"},
                                                 {"manufacturer-id", "45822603A5710"},
                                                 {"num-bus", cf::Value::SInt32(2)},
-                                                {"nand-device-desc", "256GB TLC 2-bus"}});
+                                                {"nand-device-desc", cf::Value::SInt32(0x2203)}});
   device.registry = cf::Array({
       Entry({{"class", "IOPlatformExpertDevice"}, {"name", "device-tree"}, {"id", cf::Value::UInt64(0x100000100)}}),
       Entry({{"class", "VelmoraVNS3NVMeController"},
@@ -143,7 +173,10 @@ DefaultDevice DefaultStorageDevice() {
   device.controller = Entry({{"stats", FtlFields()},
                              {"msp", cf::Array({MspFields(0), MspFields(1)})},
                              {"bandStats", ValidityList()},
-                             {"defects", DefectsList()}});
+                             {"defects", DefectsList()},
+                             {"telemetry", Entry({{"0", TelemetryFields(0)},
+                                                  {"1", TelemetryFields(1)},
+                                                  {"2", TelemetryFields(2)}})}});
   device.stackshot = cf::Array({
       Entry({{"name", "kernel_task"},
              {"threads", cf::Array({Entry({{"name", "VM_swapout"}, {"diskWrites", cf::Value::UInt64(2147483648)}}),

@@ -1,8 +1,9 @@
 // The storage half of the default device, as devsim init writes it and the
 // tests and benchmarks use it: a registry with one controller of the first
-// kind and its answers (every FTL field, two MSP buffers), a stackshot with
-// the memory freezer's thread, a purgeable-space answer, pending ECC events
-// and the boot session's id.
+// kind and its answers (every FTL field, two MSP buffers, the validity and
+// defects lists and the telemetry list of each of the three modes), a
+// stackshot with the memory freezer's thread, a purgeable-space answer,
+// pending ECC events and the boot session's id.
 #pragma once
 
 #include <string>
