@@ -4,9 +4,11 @@
 
 #include <algorithm>
 #include <chrono>
+#include <exception>
 #include <memory>
 #include <semaphore>
 #include <string>
+#include <utility>
 
 #include "collect/datausage.h"
 
@@ -103,10 +105,18 @@ void CollectReportingChannels() {}
 }  // namespace
 
 void CollectDailyScalars() {
-  CollectDiskUsage();
-  CollectStorageStructuredLog();
-  CollectNANDInfo();
-  CollectECCEvents();
-  CollectDataUsage();
-  CollectReportingChannels();
+  // Each step stands alone: one that fails, even by throwing (a device file
+  // asking for more memory than there is), leaves the others to run.
+  const std::pair<const char*, void (*)()> steps[] = {
+      {"disk usage", CollectDiskUsage},   {"storage structured log", CollectStorageStructuredLog},
+      {"NAND info", CollectNANDInfo},     {"ECC events", CollectECCEvents},
+      {"data usage", CollectDataUsage},   {"reporting channels", CollectReportingChannels},
+  };
+  for (const auto& [name, step] : steps) {
+    try {
+      step();
+    } catch (const std::exception& e) {
+      platform::LogError("The daily collection's %s step failed: %s", std::string(name), std::string(e.what()));
+    }
+  }
 }

@@ -82,6 +82,10 @@ std::optional<std::string> EncodeValidityList(const cf::Dictionary& fields, std:
   uint32_t extra = 0;
   const cf::Array* entries = ListParts(fields, "validity list", "extra", "entries", &extra, error);
   if (!entries) return std::nullopt;
+  if (8 + 8 * uint64_t{extra} + 20 * uint64_t{entries->size()} > kMaxEncodedListBytes) {
+    if (error) *error = "validity list: more than " + std::to_string(kMaxEncodedListBytes) + " bytes";
+    return std::nullopt;
+  }
   std::string out;
   PutU32(out, static_cast<uint32_t>(entries->size()));
   PutU32(out, extra);
@@ -99,6 +103,10 @@ std::optional<std::string> EncodeDefectsList(const cf::Dictionary& fields, std::
   uint32_t factory_count = 0;
   const cf::Array* defects = ListParts(fields, "defects list", "factoryCount", "defects", &factory_count, error);
   if (!defects) return std::nullopt;
+  if (12 + 32 * uint64_t{defects->size()} > kMaxEncodedListBytes) {
+    if (error) *error = "defects list: more than " + std::to_string(kMaxEncodedListBytes) + " bytes";
+    return std::nullopt;
+  }
   std::string out;
   PutU32(out, 0);
   PutU32(out, factory_count);

@@ -3,12 +3,17 @@
 // for an unknown key or a value that is not a number of the right range.
 #pragma once
 
+#include <cstddef>
 #include <optional>
 #include <string>
 
 #include "cf/value.h"
 
 namespace sim {
+
+// The most bytes an encoded list may take; a description asking for more
+// is refused rather than held in memory.
+inline constexpr size_t kMaxEncodedListBytes = size_t{64} << 20;
 
 // {"extra": number of skipped 8-byte items (default 0),
 //  "entries": [{"list": n, "value": n}, ...]}

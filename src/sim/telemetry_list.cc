@@ -101,6 +101,10 @@ std::optional<std::string> EncodeTelemetryList(const cf::Dictionary& fields, std
   }
   // Without "buses" the list has none: no bytes at all.
   if (!buses) return std::string();
+  if (buses->size() > kMaxEncodedListBytes / (kBlockWords * 4 + 32)) {
+    Fail(error, "\"buses\": more than a list of " + std::to_string(kMaxEncodedListBytes) + " bytes holds");
+    return std::nullopt;
+  }
   std::string blocks, summaries;
   for (size_t b = 0; b < buses->size(); ++b) {
     std::string block(kBlockWords * 4, '\0'), summary(32, '\0');

@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <exception>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <vector>
@@ -149,35 +150,39 @@ bool DumpStorageStructuredLog(bool verbose) {
   g_amplification.above_threshold = AboveThreshold(g_amplification.user);
 
   nand_exporter_t* kind = nullptr;
-  const io_service_t service = findNandExporter(&kind);
-  if (!service || !kind) {
+  // Closed and released on every way out, a throwing handler's too.
+  struct OpenService {
+    io_service_t service = 0;
+    io_connect_t connection = 0;
+    ~OpenService() {
+      if (connection) CloseConnection(connection);
+      if (service) IOObjectRelease(service);
+    }
+  } open;
+  open.service = findNandExporter(&kind);
+  if (!open.service || !kind) {
     std::fputs("Could not get matching IOKit service for exporting classes\n", stderr);
     return false;
   }
-  io_connect_t connection = 0;
-  if (IOServiceOpen(service, mach_task_self(), 0, &connection) != kIOReturnSuccess) {
-    IOObjectRelease(service);
+  if (IOServiceOpen(open.service, mach_task_self(), 0, &open.connection) != kIOReturnSuccess) {
+    open.connection = 0;
     std::fputs("Could not get connection to service\n", stderr);
     return false;
   }
   const cf::Value characteristics = IORegistryEntrySearchCFProperty(
-      service, kIOServicePlane, kind->propertyMatchKey, kIORegistryIterateRecursively | kIORegistryIterateParents);
+      open.service, kIOServicePlane, kind->propertyMatchKey, kIORegistryIterateRecursively | kIORegistryIterateParents);
   if (characteristics.IsNull()) {
     std::fputs("failed to create dictionary\n", stderr);
-    CloseConnection(connection);
-    IOObjectRelease(service);
     return false;
   }
   const std::vector<Retrieval> retrievals = SelectorFunctions(*kind);
-  bool result = true;
   if (retrievals.size() > kMaxRetrievals) {
     std::fputs("Increase the size of the selectorFunctions Array\n", stderr);
-  } else {
-    for (size_t i = 0; i < retrievals.size(); ++i)
-      result = FetchList(connection, *kind, retrievals[i], i, verbose, characteristics) && result;
+    return true;
   }
-  CloseConnection(connection);
-  IOObjectRelease(service);
+  bool result = true;
+  for (size_t i = 0; i < retrievals.size(); ++i)
+    result = FetchList(open.connection, *kind, retrievals[i], i, verbose, characteristics) && result;
   return result;
 }
 
@@ -212,16 +217,15 @@ bool ParseValidityList(const uint8_t* data, size_t size, const cf::Value&, std::
   return true;
 }
 
-std::optional<std::vector<cf::Dictionary>> DefectRecords(const uint8_t* data, size_t size,
-                                                         const cf::Value& characteristics,
-                                                         std::string_view class_name) {
-  if (size < 12) return std::nullopt;
-  std::vector<cf::Dictionary> records(1);
-  cf::Dictionary& header = records[0];
+bool ForEachDefectRecord(const uint8_t* data, size_t size, const cf::Value& characteristics,
+                         std::string_view class_name, const std::function<void(const cf::Dictionary&)>& each) {
+  if (size < 12) return false;
+  cf::Dictionary header;
   header.Set("Factory Count", cf::Value::SInt32(static_cast<int32_t>(ReadU32(data, 4))));
   if (const cf::Dictionary* c = characteristics.AsDictionary())
     if (const cf::Number* desc = c->Get("nand-device-desc").AsNumber())
       header.Set("com.velmora.NANDInfo.nandDesc", cf::Value::SInt32(desc->AsSInt32()));
+  each(header);
   // Entries go as far as the bytes do, whatever the count claims.
   const uint64_t count = std::min<uint64_t>(ReadU32(data, 8), (size - 12) / 32);
   for (uint64_t e = 0; e < count; ++e) {
@@ -236,7 +240,7 @@ std::optional<std::vector<cf::Dictionary>> DefectRecords(const uint8_t* data, si
         default: std::fprintf(stderr, "Encountered unexpected defectMode: 0x%x\n", mode);
       }
     }
-    cf::Dictionary& defect = records.emplace_back();
+    cf::Dictionary defect;
     auto set = [&](const char* key, uint32_t v) { defect.Set(key, cf::Value::SInt32(static_cast<int32_t>(v))); };
     set("Bus", word(0) & 0xFFFF);
     set("CE", word(0) >> 16);
@@ -246,19 +250,17 @@ std::optional<std::vector<cf::Dictionary>> DefectRecords(const uint8_t* data, si
     set("Reason", reason);
     set("Page", word(5));
     defect.Set("Temperature", cf::Number::SInt8(static_cast<int8_t>(word(6) & 0xFF)));
+    each(defect);
   }
-  return records;
+  return true;
 }
 
 bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& characteristics,
                       std::string_view class_name) {
-  const std::optional<std::vector<cf::Dictionary>> records = DefectRecords(data, size, characteristics, class_name);
-  if (!records) {
-    std::fputs("data cannot be parsed\n", stderr);
-    return false;
-  }
-  for (const cf::Dictionary& record : *records) FKLogStructuredData(176, record);
-  return true;
+  const bool read = ForEachDefectRecord(data, size, characteristics, class_name,
+                                       [](const cf::Dictionary& record) { FKLogStructuredData(176, record); });
+  if (!read) std::fputs("data cannot be parsed\n", stderr);
+  return read;
 }
 
 void DumpNANDInfo(cf::Dictionary& target) {

@@ -7,10 +7,10 @@
 #include <array>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <optional>
-#include <vector>
 
 #include "cf/value.h"
 
@@ -32,11 +32,11 @@ bool ParseDefectsList(const uint8_t* data, size_t size, const cf::Value& charact
 // 15 in entry order (other numbers dropped), or nothing when the list has no
 // entries or is shorter than it claims.
 std::optional<std::array<cf::Array, 16>> ValidityValues(const uint8_t* data, size_t size);
-// The defects list's records: its header, then one per entry that fits;
-// nothing when the header itself does not.
-std::optional<std::vector<cf::Dictionary>> DefectRecords(const uint8_t* data, size_t size,
-                                                         const cf::Value& characteristics,
-                                                         std::string_view class_name);
+// Hands each record of a defects list to each as it is read: its header,
+// then one per entry that fits. False, with nothing handed on, when the
+// header itself does not fit.
+bool ForEachDefectRecord(const uint8_t* data, size_t size, const cf::Value& characteristics,
+                         std::string_view class_name, const std::function<void(const cf::Dictionary&)>& each);
 
 // The NAND info keys (without the version keys) added to target.
 void DumpNANDInfo(cf::Dictionary& target);

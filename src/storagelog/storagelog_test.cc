@@ -271,6 +271,7 @@ TEST_F(StorageLogTest, EncodersRefuseWhatAListCannotHold) {
       {Dict({{"entries", cf::Array({Dict({{"list", cf::Value::SInt64(4294967296)}})})}}), true, "4294967296"},
       {Dict({{"entries", cf::Array({Dict({{"lsit", cf::Value::SInt64(1)}})})}}), true, "unknown key lsit"},
       {Dict({{"entries", Dict({})}}), true, "expected an array"},
+      {Dict({{"extra", cf::Value::SInt64(4294967295)}}), true, "more than 67108864 bytes"},
       {Dict({{"defects", cf::Array({Dict({{"Bus", cf::Value::SInt64(65536)}})})}}), false, "16 bits"},
       {Dict({{"defects", cf::Array({cf::Value("x")})}}), false, "expected a dictionary"},
   };
