@@ -41,6 +41,12 @@ cf::Value IOReportCreateSamples(const IOReportSubscriptionRef& subscription, con
                                 IOReportErrorOut error);
 // raw: data.
 cf::Value IOReportCreateSamplesRaw(const cf::Value& channels, const cf::Value& raw, IOReportErrorOut error);
+// Later less earlier, channel by channel, with the later aggregate's
+// nesting; a channel without an earlier partner keeps its own values.
+cf::Value IOReportCreateSamplesDelta(const cf::Value& earlier, const cf::Value& later, IOReportErrorOut error);
+// One pair of channel samples; the result copies the earlier one.
+cf::Value IOReportSampleCreateDelta(const cf::Value& earlier, const cf::Value& later, IOReportErrorOut error);
+
 int64_t IOReportSimpleGetIntegerValue(const cf::Dictionary& sample, int64_t* unit);
 int64_t IOReportArrayGetValueAtIndex(const cf::Dictionary& sample, int index);
 

@@ -394,4 +394,105 @@ TEST_F(IOReportSubscriptionTest, EachFailingStepSaysWhichItWas) {
   EXPECT_EQ(platform::OpenIOObjectCount(), 0u);
 }
 
+cf::Dictionary Sample(int64_t id, uint64_t type, std::initializer_list<std::initializer_list<int64_t>> elements) {
+  std::string raw;
+  for (const auto& values : elements) raw += Element(0x10, static_cast<uint64_t>(id), type, 0, values);
+  cf::Dictionary s;
+  s.Set("DriverID", cf::Value::SInt64(0x10));
+  s.Set("LegendChannel", cf::Array({cf::Value::SInt64(id), cf::Value::SInt64(static_cast<int64_t>(type))}));
+  s.Set("RawElements", Raw(raw));
+  return s;
+}
+
+int64_t Slot(const cf::Value& sample, size_t element, size_t i) {
+  int64_t v;
+  std::memcpy(&v, sample.AsDictionary()->Get("RawElements").AsData()->data() + 64 * element + 32 + 8 * i, 8);
+  return v;
+}
+
+TEST(IOReportDeltaTest, PairsOfSamplesByFormat) {
+  constexpr int64_t kNone = kIOReportInvalidValue;
+  std::optional<IOReportError> error;
+  const cf::Dictionary before = Sample(1, Type(1, 0, 1), {{100}});
+  const cf::Dictionary after = Sample(1, Type(1, 0, 1), {{250}});
+  const cf::Value simple = IOReportSampleCreateDelta(before, after, &error);
+  EXPECT_EQ(IOReportSimpleGetIntegerValue(*simple.AsDictionary(), nullptr), 150);
+  EXPECT_EQ(Slot(simple, 0, 1), kNone);  // slots the format does not use are marked
+  EXPECT_EQ(IOReportSimpleGetIntegerValue(before, nullptr), 100);  // the inputs stay as they were
+  EXPECT_TRUE(IOReportSampleCreateDelta(Sample(1, Type(1, 0, 1), {{kNone}}), after, &error).IsNull());
+
+  const cf::Value state = IOReportSampleCreateDelta(Sample(2, Type(2, 0, 2), {{0x41, 1, 10}, {0x42, 2, 20}}),
+                                                    Sample(2, Type(2, 0, 2), {{0x41, 4, 15}, {0x42, 2, 50}}), &error);
+  EXPECT_EQ(IOReportStateGetInTransitions(*state.AsDictionary(), 0), 3);
+  EXPECT_EQ(IOReportStateGetResidency(*state.AsDictionary(), 1), 30);
+  EXPECT_EQ(IOReportStateGetIDForIndex(*state.AsDictionary(), 1), 0x42);
+  EXPECT_TRUE(IOReportSampleCreateDelta(Sample(2, Type(2, 0, 1), {{0x41, 1, 10}}),
+                                        Sample(2, Type(2, 0, 2), {{0x41, 4, 15}, {0x42, 2, 50}}), &error)
+                  .IsNull());
+
+  // hits, minimum, maximum, sum per bucket
+  const cf::Value histogram =
+      IOReportSampleCreateDelta(Sample(3, Type(3, 0, 3), {{2, 1, 9, 12}, {0, 5, 5, 77}, {1, 1, 1, 1}}),
+                                Sample(3, Type(3, 0, 3), {{5, 1, 9, 40}, {3, 4, 8, 20}, {1, 1, 1, 1}}), &error);
+  EXPECT_EQ(IOReportHistogramGetBucketHits(*histogram.AsDictionary(), 0), 3);
+  EXPECT_EQ(IOReportHistogramGetBucketSum(*histogram.AsDictionary(), 0), 28);
+  EXPECT_EQ(IOReportHistogramGetBucketSum(*histogram.AsDictionary(), 1), 20);  // the earlier sum had no hits
+  EXPECT_EQ(IOReportHistogramGetBucketMinValue(*histogram.AsDictionary(), 1), 4);
+  EXPECT_EQ(IOReportHistogramGetBucketHits(*histogram.AsDictionary(), 2), 0);
+  EXPECT_EQ(IOReportHistogramGetBucketSum(*histogram.AsDictionary(), 2), kNone);
+
+  const cf::Value array = IOReportSampleCreateDelta(Sample(4, Type(4, 0, 1), {{kNone, 5, 9, kNone}}),
+                                                    Sample(4, Type(4, 0, 1), {{3, kNone, 10, kNone}}), &error);
+  EXPECT_EQ(IOReportArrayGetValueAtIndex(*array.AsDictionary(), 0), 3);
+  EXPECT_EQ(IOReportArrayGetValueAtIndex(*array.AsDictionary(), 1), 5);
+  EXPECT_EQ(IOReportArrayGetValueAtIndex(*array.AsDictionary(), 2), 1);
+  EXPECT_EQ(IOReportArrayGetValueAtIndex(*array.AsDictionary(), 3), kNone);
+
+  error.reset();
+  EXPECT_TRUE(IOReportSampleCreateDelta(before, Sample(1, Type(4, 0, 1), {{1}}), &error).IsNull());
+  EXPECT_EQ(error->failure_reason, "mismatched formats");
+  EXPECT_EQ(error->code, kIOReturnBadArgument);
+  EXPECT_TRUE(IOReportSampleCreateDelta(Sample(1, Type(7, 0, 1), {{1}}), Sample(1, Type(7, 0, 1), {{1}}), &error)
+                  .IsNull());
+  EXPECT_EQ(error->failure_reason, "unknown report format");
+  EXPECT_EQ(static_cast<uint32_t>(error->code), 0xe00002e6u);
+}
+
+TEST(IOReportDeltaTest, AggregatesPairChannelsByDriverIDAndType) {
+  const auto aggregate = [](std::initializer_list<cf::Dictionary> channels) {
+    cf::Value a = IOReportCreateAggregate(kIOReportByDriver);
+    for (const cf::Dictionary& c : channels) {
+      cf::Dictionary named = c.MutableCopy();
+      named.Set("DriverName", "D");
+      IOReportMergeChannels(a, Dict({{"IOReportChannels", cf::Array({named})}}), nullptr);
+    }
+    return a;
+  };
+  // The earlier sample has a channel the later one lost, and lacks one.
+  const cf::Value earlier = aggregate(
+      {Sample(9, Type(1, 0, 1), {{0}}), Sample(1, Type(1, 0, 1), {{10}}), Sample(2, Type(1, 0, 1), {{20}})});
+  const cf::Value later = aggregate({Sample(1, Type(1, 0, 1), {{11}}), Sample(2, Type(1, 0, 1), {{25}}),
+                                     Sample(3, Type(1, 0, 1), {{7}})});
+  std::optional<IOReportError> error;
+  const cf::Value delta = IOReportCreateSamplesDelta(earlier, later, &error);
+  ASSERT_FALSE(delta.IsNull());
+  std::vector<int64_t> values;
+  IOReportIterate(delta, [&](const cf::Dictionary& c) {
+    values.push_back(IOReportSimpleGetIntegerValue(c, nullptr));
+    return 0;
+  });
+  EXPECT_EQ(values, (std::vector<int64_t>{1, 5, 7}));
+
+  // A driver level the earlier sample does not have.
+  EXPECT_TRUE(IOReportCreateSamplesDelta(IOReportCreateAggregate(kIOReportByDriver), later, &error).IsNull());
+  // A channel of the same ID with another type is no partner.
+  const cf::Value retyped = aggregate({Sample(1, Type(1, 0x100, 1), {{5}})});
+  const cf::Value alone = IOReportCreateSamplesDelta(retyped, aggregate({Sample(1, Type(1, 0, 1), {{11}})}), &error);
+  IOReportIterate(alone, [](const cf::Dictionary& c) {
+    EXPECT_EQ(IOReportSimpleGetIntegerValue(c, nullptr), 11);
+    return 0;
+  });
+  EXPECT_EQ(IOReportGetChannelCount(alone), 1);
+}
+
 }  // namespace
