@@ -71,6 +71,12 @@ IOReturn IOReportHistogramGetBucketBounds(const cf::Dictionary& channel, int ind
 
 double IOReportScaleValue(uint64_t value, uint64_t fromUnit, uint64_t toUnit);
 
+// One line per element, each beginning with prefix; null for a sample of
+// unknown format or one whose lines cannot all be made.
+cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::Value& unused, const char* prefix);
+// Writes the string's bytes; a short write is an error of its own.
+IOReturn IOReportWriteStringUTF8(int fd, const cf::Value& string);
+
 // Cuts a raw buffer into the channels' records without copying it first;
 // IOReportCreateSamplesRaw and the subscription's samples both end here.
 cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw, IOReportErrorOut error);

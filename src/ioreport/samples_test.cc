@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <array>
 #include <cmath>
 #include <cstring>
@@ -493,6 +496,71 @@ TEST(IOReportDeltaTest, AggregatesPairChannelsByDriverIDAndType) {
     return 0;
   });
   EXPECT_EQ(IOReportGetChannelCount(alone), 1);
+}
+
+std::string Right(size_t width, const std::string& text) {
+  return std::string(width > text.size() ? width - text.size() : 0, ' ') + text;
+}
+
+TEST(IOReportDescriptionTest, OneLinePerElement) {
+  const cf::Value ms = IOReportCreateUnitInfo(0x0100007c00000000);
+  cf::Dictionary simple = Sample(1, Type(1, 0, 1), {{250}});
+  simple.Set("IOReportChannelInfo", ms);
+  simple.Set("LegendChannel", cf::Array({cf::Value::SInt64(1), cf::Value::SInt64(Type(1, 0, 1)), "Total"}));
+  EXPECT_EQ(IOReportSampleCopyDescription(simple, {}, "> "),
+            cf::Value("> " + Right(32, "Total") + " = { " + Right(12, "250") + " ms }\n"));
+
+  cf::Dictionary state = Sample(0x4D6F6465, Type(2, 0, 3), {{0x4F4646, 4, 30000}, {0x4F4E, 7, 10000}, {0x5A, 0, 0}});
+  state.Set("IOReportChannelInfo", ms);
+  EXPECT_EQ(IOReportSampleCopyDescription(state, {}, nullptr),
+            cf::Value(Right(20, "Mode") + "[     OFF] = { # 4        3.000e+01 s / 75.0% }\n" + Right(20, "Mode") +
+                      "[      ON] = { # 7        1.000e+01 s / 25.0% }\n" + Right(20, "Mode") +
+                      "[       Z] = { # 0        0.000e+00 s /  0.0% }\n"));
+  // One state without a text form: every state goes by its ID.
+  cf::Dictionary unnamed = Sample(0x4D6F6465, Type(2, 0, 2), {{7, 1, 5}, {0x4F4E, 1, 5}});
+  unnamed.Set("IOReportChannelInfo", ms);
+  EXPECT_EQ(IOReportSampleCopyDescription(unnamed, {}, nullptr),
+            cf::Value(Right(20, "Mode") + "[     0x7] = { # 1        5.000e-03 s / 50.0% }\n" + Right(20, "Mode") +
+                      "[  0x4f4e] = { # 1        5.000e-03 s / 50.0% }\n"));
+
+  cf::Dictionary histogram = Sample(3, Type(3, 0, 2), {{2, 11, 19, 30}, {0, 0, 0, 0}});
+  histogram.Set("LegendChannel", cf::Array({cf::Value::SInt64(3), cf::Value::SInt64(Type(3, 0, 2)), "Lat"}));
+  histogram.Set("IOReportChannelInfo", Dict({{"IOReportChannelUnit", cf::Value::SInt64(0x0100007c00000000)},
+                                             {"IOReportChannelConfig", Segments({{10, 0, 0, 2}})}}));
+  EXPECT_EQ(IOReportSampleCopyDescription(histogram, {}, ""),
+            cf::Value(Right(20, "Lat") + "[" + Right(12, "0") + " - " + Right(12, "10") + " ms] = { m " +
+                      Right(12, "11") + "; M " + Right(12, "19") + "; s " + Right(12, "30") + "; # " + Right(12, "2") +
+                      " }\n" + Right(20, "Lat") + "[" + Right(12, "10") + " - " + Right(12, "20") +
+                      " ms] = { <no hits>; # 0 }\n"));
+
+  EXPECT_EQ(IOReportSampleCopyDescription(Sample(4, Type(4, 0, 2), {{1}, {2}}), {}, ""),
+            cf::Value("arrays unsupported?arrays unsupported?"));
+  // Lines that cannot be made: no bounds, no value, no elements, no format.
+  histogram.Remove("ProcessedChannelConfig");
+  histogram.Set("IOReportChannelInfo", ms);
+  EXPECT_TRUE(IOReportSampleCopyDescription(histogram, {}, "").IsNull());
+  EXPECT_TRUE(IOReportSampleCopyDescription(Sample(1, Type(1, 0, 1), {{kIOReportInvalidValue}}), {}, "").IsNull());
+  simple.Remove("RawElements");
+  EXPECT_TRUE(IOReportSampleCopyDescription(simple, {}, "").IsNull());
+  EXPECT_TRUE(IOReportSampleCopyDescription(Sample(1, Type(0, 0, 1), {{1}}), {}, "").IsNull());
+  EXPECT_TRUE(IOReportSampleCopyDescription(Sample(1, Type(5, 0, 1), {{1}}), {}, "").IsNull());
+}
+
+TEST(IOReportDescriptionTest, WritingText) {
+  int fds[2];
+  ASSERT_EQ(pipe(fds), 0);
+  EXPECT_EQ(IOReportWriteStringUTF8(fds[1], cf::Value("caf\xc3\xa9\n")), kIOReturnSuccess);
+  char buffer[16] = {};
+  EXPECT_EQ(read(fds[0], buffer, sizeof buffer), 6);
+  EXPECT_STREQ(buffer, "caf\xc3\xa9\n");
+  EXPECT_EQ(IOReportWriteStringUTF8(fds[1], cf::Value()), kIOReturnBadArgument);
+  // A pipe that takes only part of the text.
+  ASSERT_EQ(fcntl(fds[1], F_SETFL, O_NONBLOCK), 0);
+  EXPECT_EQ(static_cast<uint32_t>(IOReportWriteStringUTF8(fds[1], cf::Value(std::string(1 << 20, 'x')))),
+            0xe00002e7u);
+  close(fds[0]);
+  close(fds[1]);
+  EXPECT_EQ(static_cast<uint32_t>(IOReportWriteStringUTF8(fds[1], cf::Value("x"))), 0xe00002cau);
 }
 
 }  // namespace
