@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <string>
 
+#include "collect/ioreport_keys.h"
 #include "nandinfo/nandinfo.h"
 #include "platform/diagnostics.h"
 #include "platform/log.h"
@@ -80,10 +81,6 @@ void CollectECCEvents() {
 // Step 5: per-process network usage. (A seam until the collection work builds it.)
 void CollectDataUsage() {}
 
-// Step 6: the reporting channels of the field category. (A seam until the
-// reporting channels are built.)
-void CollectReportingChannels() {}
-
 }  // namespace
 
 void CollectDailyScalars() {
@@ -92,5 +89,5 @@ void CollectDailyScalars() {
   CollectNANDInfo();
   CollectECCEvents();
   CollectDataUsage();
-  CollectReportingChannels();
+  CollectReportingChannels();  // step 6: the field category's simple channels
 }

@@ -1,8 +1,8 @@
 // The storage half of the default device, as devsim init writes it and the
 // tests and benchmarks use it: a registry with one controller of the first
 // kind and its answers (every FTL field, two MSP buffers), a stackshot with
-// the memory freezer's thread, a purgeable-space answer, pending ECC events
-// and the boot session's id.
+// the memory freezer's thread, a purgeable-space answer, pending ECC events,
+// the boot session's id, and a reporting hub with two drivers' channels.
 #pragma once
 
 #include <string>
@@ -17,6 +17,7 @@ struct DefaultDevice {
   cf::Value stackshot;   // device/stackshot.plist
   cf::Value purgeable;   // device/purgeable.plist
   cf::Value ecc_events;  // device/ecc-events.plist
+  cf::Value ioreport;    // device/ioreport.plist
   std::string boot_session_uuid;  // "kern.bootsessionuuid" of device/sysctl.plist
 };
 DefaultDevice DefaultStorageDevice();

@@ -1,6 +1,8 @@
 // The daily collection's own keys and records through whole runs: disk
-// usage, the kernel's ECC events and the storage structured log.
+// usage, the kernel's ECC events, the storage structured log and the
+// reporting channels.
 #include "../test_values.h"
+#include "sim/default_device.h"
 #include "root_fixture.h"
 
 namespace {
@@ -99,6 +101,38 @@ TEST_F(CollectRun, TheDefaultDeviceGivesItsStorageRecordsAndAWeeklyStatusLog) {
   env["TALLYRUN_NOW"] = "2026-11-29T15:00:00Z";
   r = Tallyrun({"-f"});
   EXPECT_EQ(status_logs().size(), 2u) << r.err;
+}
+
+TEST_F(CollectRun, TheDefaultDevicesSimpleFieldChannelsBecomeKeys) {
+  RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.ioreport.CPU0"), "52840") << r.err;  // named by its ID
+  EXPECT_EQ(Scalar("com.velmora.ioreport.GPUEnergy"), "1200");
+  EXPECT_EQ(Scalar("com.velmora.ioreport.HostReadMiB"), "30512");
+  EXPECT_EQ(Scalar("com.velmora.ioreport.QueueDepth"), "(missing)");  // not the field category
+  EXPECT_EQ(Scalar("com.velmora.ioreport.PerformanceStates"), "(missing)");
+  EXPECT_EQ(Scalar("com.velmora.ioreport.ReadLatency"), "(missing)");
+
+  // A hub whose buffer cannot be refreshed: the values stay as they were
+  // and the rest of the collection still runs.
+  WritePlist("device/ioreport.plist", Dict({{"4294970144", Dict({{"1", cf::Value::SInt64(31000)}})}}));
+  cf::Array registry = sim::DefaultStorageDevice().registry.AsArray()->MutableCopy();
+  for (size_t i = 0; i < registry.size(); ++i) {
+    cf::Dictionary service = registry[i].AsDictionary()->MutableCopy();
+    if (service.Get("class") == cf::Value("IOReportHub"))
+      service.Set("properties", Dict({{"failSelectors", cf::Array({cf::Value::SInt64(3)})}}));
+    registry.Set(i, service);
+  }
+  WritePlist("device/registry.plist", registry);
+  WritePlist("device/answers.plist",
+             Dict({{"DiskUsage", Dict({{"TotalDiskCapacity", cf::Value::SInt64(64000000000)}})}}));
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.ioreport.HostReadMiB"), "30512") << r.err;
+  EXPECT_EQ(Scalar("com.velmora.homedeck.DiskUsageUserTotalBlocks"), "61035");
+  // Working again, the day's value is replaced.
+  WritePlist("device/registry.plist", sim::DefaultStorageDevice().registry);
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.ioreport.HostReadMiB"), "31000") << r.err;
+  EXPECT_EQ(Scalar("com.velmora.ioreport.CPU0"), "0");  // no longer in the file
 }
 
 }  // namespace
