@@ -35,6 +35,7 @@ void AskSample(const cf::Dictionary& s) {
   (void)IOReportHistogramGetMinValue(s);
   (void)IOReportHistogramGetMaxValue(s);
   (void)IOReportSampleCreateDelta(s, s, nullptr);
+  (void)IOReportSampleCopyDescription(s, {}, "  ");
 }
 
 }  // namespace
