@@ -1,5 +1,6 @@
 #include "sim/default_device.h"
 
+#include <cstring>
 #include <map>
 #include <string>
 
@@ -132,6 +133,14 @@ cf::Value LegendChannel(int64_t id, uint8_t format, uint16_t categories, uint16_
   return channel;
 }
 
+// One linear segment of a histogram's configuration: buckets of width.
+cf::Value HistogramConfig(uint32_t width, int32_t buckets) {
+  uint8_t segment[16] = {};
+  std::memcpy(segment, &width, 4);
+  std::memcpy(segment + 12, &buckets, 4);
+  return cf::Value::Bytes(cf::Data(segment, segment + 16));
+}
+
 cf::Value Values(std::initializer_list<int64_t> values) {
   cf::Array a;
   for (int64_t v : values) a.Append(cf::Value::SInt64(v));
@@ -174,8 +183,12 @@ DefaultDevice DefaultStorageDevice() {
                                          Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0300007c00000000)}})},
                                         {"IOReportChannels",
                                          cf::Array({LegendChannel(0x43505530, 1, 0x0100, 1, nullptr),
-                                                    LegendChannel(2, 1, 0x0100, 1, "GPUEnergy"),
-                                                    LegendChannel(3, 2, 0x0100, 3, "PerformanceStates")})}})})}})}}),
+                                                    LegendChannel(2, 1, 0x0100, 1, "GPUEnergy")})}}),
+                                 Entry({{"IOReportGroupName", "CPU States"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0100007900000000)}})},
+                                        {"IOReportChannels",
+                                         cf::Array({LegendChannel(3, 2, 0x0100, 3, "PerformanceStates")})}})})}})}}),
       Entry({{"class", "StorageReporter"},
              {"name", "nvme-report"},
              {"id", cf::Value::UInt64(0x100000B20)},
@@ -184,10 +197,19 @@ DefaultDevice DefaultStorageDevice() {
               Entry({{"IOReportLegendPublic", cf::Value::Bool(true)},
                      {"IOReportLegend",
                       cf::Array({Entry({{"IOReportGroupName", "Storage"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0900960000000000)}})},
+                                        {"IOReportChannels", cf::Array({LegendChannel(1, 1, 0x0100, 1, "HostReadMiB")})}}),
+                                 Entry({{"IOReportGroupName", "Storage"},
+                                        {"IOReportChannels", cf::Array({LegendChannel(2, 1, 0x0002, 1, "QueueDepth")})}}),
+                                 // Read latency in microseconds, four buckets of 100.
+                                 Entry({{"IOReportGroupName", "Storage"},
+                                        {"IOReportSubGroupName", "Latency"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0100007900000000)},
+                                                {"IOReportChannelConfig", HistogramConfig(100, 4)}})},
                                         {"IOReportChannels",
-                                         cf::Array({LegendChannel(1, 1, 0x0100, 1, "HostReadMiB"),
-                                                    LegendChannel(2, 1, 0x0002, 1, "QueueDepth"),
-                                                    LegendChannel(3, 3, 0x0100, 4, "ReadLatency")})}})})}})}}),
+                                         cf::Array({LegendChannel(3, 3, 0x0100, 4, "ReadLatency")})}})})}})}}),
   });
   // Values of the hub's channels: driver entry ID → channel ID → value, or
   // one [v0, v1, v2, v3] per element.
@@ -200,7 +222,7 @@ DefaultDevice DefaultStorageDevice() {
        {"4294970144",
         Entry({{"1", cf::Value::SInt64(30512)},
                {"2", cf::Value::SInt64(7)},
-               {"3", cf::Array({Values({120, 20, 95, 7600}), Values({40, 110, 480, 9800}), Values({3, 1200, 2100, 4900}),
+               {"3", cf::Array({Values({120, 20, 95, 7600}), Values({40, 105, 198, 5800}), Values({3, 210, 290, 750}),
                                 Values({0, 0, 0, 0})})}})}});
   device.controller = Entry({{"stats", FtlFields()},
                              {"msp", cf::Array({MspFields(0), MspFields(1)})},

@@ -135,4 +135,48 @@ TEST_F(CollectRun, TheDefaultDevicesSimpleFieldChannelsBecomeKeys) {
   EXPECT_EQ(Scalar("com.velmora.ioreport.CPU0"), "0");  // no longer in the file
 }
 
+std::string Right(size_t width, const std::string& text) {
+  return std::string(width > text.size() ? width - text.size() : 0, ' ') + text;
+}
+
+TEST_F(CollectRun, DevsimShowsEveryChannelWithASample) {
+  RunResult r = RunProgram(DEVSIM_BIN, {"ioreport", root.path()}, env);
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_EQ(r.err, "");
+  const std::string pmgr = "pmgr <id 0x100000b10> ";
+  const std::string expected =
+      pmgr + "CPU0 < 0x43505530 (mJ) | G/g Energy Model/(none) | cat 0x100 | format 0x01 | elts 1 >\n" + "  " +
+      Right(32, "CPU0") + " = { " + Right(12, "52840") + " mJ }\n" + pmgr +
+      "GPUEnergy < 0x2 (mJ) | G/g Energy Model/(none) | cat 0x100 | format 0x01 | elts 1 >\n" + "  " +
+      Right(32, "GPUEnergy") + " = { " + Right(12, "1200") + " mJ }\n" + pmgr +
+      "PerformanceStates < 0x3 (us) | G/g CPU States/(none) | cat 0x100 | format 0x02 | elts 3 >\n" + "  " +
+      Right(20, "PerformanceStates") + "[     OFF] = { # 40       6.120e+01 s / 70.8% }\n" + "  " +
+      Right(20, "PerformanceStates") + "[     LOW] = { # 310      1.800e+01 s / 20.8% }\n" + "  " +
+      Right(20, "PerformanceStates") + "[    HIGH] = { # 275      7.200e+00 s /  8.3% }\n";
+  EXPECT_EQ(r.out.substr(0, expected.size()), expected);
+  const std::string latency = "  " + Right(20, "ReadLatency") + "[" + Right(12, "0") + " - " + Right(12, "100") +
+                              " us] = { m " + Right(12, "20") + "; M " + Right(12, "95") + "; s " + Right(12, "7600") +
+                              "; # " + Right(12, "120") + " }\n";
+  EXPECT_NE(r.out.find(latency), std::string::npos) << r.out;
+  EXPECT_NE(r.out.find("  " + Right(20, "ReadLatency") + "[" + Right(12, "300") + " - " + Right(12, "400") +
+                       " us] = { <no hits>; # 0 }\n"),
+            std::string::npos);
+  EXPECT_NE(r.out.find("nvme-report <id 0x100000b20> QueueDepth < 0x2 ((null)) | G/g Storage/(none) | cat 0x02 |"),
+            std::string::npos);
+
+  // A hub that cannot map its buffer.
+  cf::Array registry = sim::DefaultStorageDevice().registry.AsArray()->MutableCopy();
+  for (size_t i = 0; i < registry.size(); ++i) {
+    cf::Dictionary service = registry[i].AsDictionary()->MutableCopy();
+    if (service.Get("class") == cf::Value("IOReportHub"))
+      service.Set("properties", Dict({{"failMap", cf::Value::Bool(true)}}));
+    registry.Set(i, service);
+  }
+  WritePlist("device/registry.plist", registry);
+  r = RunProgram(DEVSIM_BIN, {"ioreport", root.path()}, env);
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "devsim: " + root.path() +
+                       ": the reporting hub could not be subscribed to: Mach error 0xe00002bc: IOConnectMapMemory() failed\n");
+}
+
 }  // namespace
