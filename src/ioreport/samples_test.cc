@@ -386,6 +386,24 @@ TEST_F(IOReportSubscriptionTest, EachFailingStepSaysWhichItWas) {
   EXPECT_TRUE(IOReportCreateSamples(nullptr, subscribed, &error).IsNull());
   EXPECT_EQ(error->code, kIOReturnBadArgument);
 
+  // A buffer the hub will not keep: 17 channels of 65535 elements.
+  Write("registry.plist",
+        cf::Array({Dict({{"class", "IOReportHub"}, {"id", cf::Value::UInt64(1)}, {"userClient", "hub"}}),
+                   Dict({{"class", "PMGR"}, {"id", cf::Value::UInt64(0x20)},
+                         {"properties",
+                          Dict({{"IOReportLegend",
+                                 cf::Array({Dict({{"IOReportChannels",
+                                                   cf::Array({cf::Value(cf::Array(
+                                                       {cf::Value::SInt64(9), cf::Value::SInt64(Type(1, 0, 0xFFFF))}))})}})})}})}})}));
+  cf::Value huge = IOReportCreateAggregate(0);
+  for (int i = 0; i < 17; ++i)
+    IOReportAddChannelDescription(huge, 0x20, "PMGR", 9, static_cast<int64_t>(Type(1, 0, 0xFFFF)), {}, {}, {}, {},
+                                  nullptr);
+  error.reset();
+  EXPECT_FALSE(IOReportCreateSubscription(nullptr, huge, &subscribed, 0, &error));
+  EXPECT_EQ(error->failure_reason, "kIOReportUserClientConfigureInterests failed");
+  EXPECT_EQ(error->code, kIOReturnNoMemory);
+
   // No hub at all: not found, without a message.
   Write("registry.plist", cf::Array({Dict({{"class", "PMGR"}, {"id", cf::Value::UInt64(0x20)}})}));
   cf::Value one = IOReportCreateAggregate(0);

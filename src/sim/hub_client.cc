@@ -25,6 +25,9 @@ constexpr uint32_t kBufferToken = 1;
 constexpr size_t kElementSize = 64;
 // The largest interest list the hub takes: its size must fit 32 bits.
 constexpr uint64_t kMaxInterests = 89478478;
+// The largest shared buffer it keeps; legends may claim 65535 elements a
+// channel, and an interest list may name a channel many times.
+constexpr size_t kMaxBuffer = size_t{64} << 20;
 
 struct Interest {
   uint64_t driver_id = 0;
@@ -110,6 +113,11 @@ class HubClient : public UserClient {
       if (!type) continue;  // the hub knows no such channel
       interest.type = *type;
       total += Elements(interest) * kElementSize;
+      if (total > kMaxBuffer) {
+        records_.clear();
+        configured_ = false;
+        return kIOReturnNoMemory;
+      }
       records_.push_back(interest);
     }
     buffer_.assign(total, 0);
