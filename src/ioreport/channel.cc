@@ -51,6 +51,36 @@ std::optional<std::string> renderIDAsText(uint64_t id) {
   return text;
 }
 
+bool isUTF8(std::string_view text) {
+  const auto* p = reinterpret_cast<const unsigned char*>(text.data());
+  const size_t n = text.size();
+  for (size_t i = 0; i < n;) {
+    const unsigned char b = p[i];
+    size_t length;
+    unsigned char lo = 0x80, hi = 0xBF;  // the second byte's range
+    if (b < 0x80) length = 1;
+    else if (b >= 0xC2 && b <= 0xDF) length = 2;
+    else if (b >= 0xE0 && b <= 0xEF) {
+      length = 3;
+      if (b == 0xE0) lo = 0xA0;
+      if (b == 0xED) hi = 0x9F;
+    } else if (b >= 0xF0 && b <= 0xF4) {
+      length = 4;
+      if (b == 0xF0) lo = 0x90;
+      if (b == 0xF4) hi = 0x8F;
+    } else {
+      return false;
+    }
+    if (length > n - i) return false;
+    for (size_t k = 1; k < length; ++k) {
+      const unsigned char c = p[i + k];
+      if (c < (k == 1 ? lo : 0x80) || c > (k == 1 ? hi : 0xBF)) return false;
+    }
+    i += length;
+  }
+  return true;
+}
+
 }  // namespace ioreport_internal
 
 using namespace ioreport_internal;

@@ -30,10 +30,16 @@ cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::
   const std::string lead = prefix ? prefix : "";
   const uint8_t format = IOReportChannelGetFormat(sample);
   if (format == kIOReportFormatUnknown || format > kIOReportFormatSimpleArray) return cf::Value();
-  const std::string name = IOReportChannelGetChannelName(sample);
   const cf::Value unit = IOReportChannelGetUnitLabel(sample);
   const size_t count = elementCount(sample, format);
   if (count == 0) return cf::Value();
+  std::string name = IOReportChannelGetChannelName(sample);
+  if (!isUTF8(name)) {
+    // A name that is not text goes by the channel ID of its first element.
+    uint64_t id;
+    std::memcpy(&id, sample.Get("RawElements").AsData()->data() + 8, 8);
+    name = cf::Format("%#llx", id).substr(0, 9);
+  }
   std::string text;
   for (size_t k = 0; k < count; ++k) {
     const int i = static_cast<int>(k);
@@ -85,6 +91,7 @@ cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::
 IOReturn IOReportWriteStringUTF8(int fd, const cf::Value& string) {
   const std::string* text = string.AsString();
   if (!text) return kIOReturnBadArgument;
+  if (!isUTF8(*text)) return kIOReturnNoMemory;  // no UTF-8 form to write
   const ssize_t written = platform::WriteToDescriptor(fd, *text);
   if (written < 0) return kIOReturnIOError;
   if (static_cast<size_t>(written) != text->size()) return kIOReturnShortWrite;

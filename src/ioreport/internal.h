@@ -5,6 +5,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "cf/value.h"
 #include "ioreport/ioreport.h"
@@ -27,6 +28,10 @@ uint32_t queryOptions(const cf::Dictionary& aggregate);
 // skipped, every other byte printable. None when no character results or a
 // byte is not printable.
 std::optional<std::string> renderIDAsText(uint64_t id);
+
+// Whether the bytes are well-formed UTF-8 (shortest forms, no surrogates,
+// nothing past U+10FFFF).
+bool isUTF8(std::string_view text);
 
 // Files a channel dictionary into the aggregate under the options' nesting.
 IOReturn addChannel(const cf::Value& aggregate, const cf::Value& channel, uint32_t options);

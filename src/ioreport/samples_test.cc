@@ -553,6 +553,11 @@ TEST(IOReportDescriptionTest, OneLinePerElement) {
 
   EXPECT_EQ(IOReportSampleCopyDescription(Sample(4, Type(4, 0, 2), {{1}, {2}}), {}, ""),
             cf::Value("arrays unsupported?arrays unsupported?"));
+  // A name that is not text: the first element's ID, cut to nine characters.
+  cf::Dictionary odd = Sample(0x123456789A, Type(1, 0, 1), {{5}});
+  odd.Set("ChannelName", "\xff\xfe");
+  EXPECT_EQ(IOReportSampleCopyDescription(odd, {}, ""),
+            cf::Value(Right(32, "0x1234567") + " = { " + Right(12, "5") + " (null) }\n"));
   // Lines that cannot be made: no bounds, no value, no elements, no format.
   histogram.Remove("ProcessedChannelConfig");
   histogram.Set("IOReportChannelInfo", ms);
@@ -572,6 +577,10 @@ TEST(IOReportDescriptionTest, WritingText) {
   EXPECT_EQ(read(fds[0], buffer, sizeof buffer), 6);
   EXPECT_STREQ(buffer, "caf\xc3\xa9\n");
   EXPECT_EQ(IOReportWriteStringUTF8(fds[1], cf::Value()), kIOReturnBadArgument);
+  for (const char* bad : {"\xff", "a\xc3", "\xc0\x80", "\xed\xa0\x80", "\xf4\x90\x80\x80", "\xe2\x82"})
+    EXPECT_EQ(IOReportWriteStringUTF8(fds[1], cf::Value(bad)), kIOReturnNoMemory) << bad;
+  EXPECT_EQ(IOReportWriteStringUTF8(fds[1], cf::Value("\xf0\x9f\x98\x80\xe2\x82\xac")), kIOReturnSuccess);
+  EXPECT_EQ(read(fds[0], buffer, sizeof buffer), 7);
   // A pipe that takes only part of the text.
   ASSERT_EQ(fcntl(fds[1], F_SETFL, O_NONBLOCK), 0);
   EXPECT_EQ(static_cast<uint32_t>(IOReportWriteStringUTF8(fds[1], cf::Value(std::string(1 << 20, 'x')))),
