@@ -33,6 +33,11 @@ std::optional<std::string> renderIDAsText(uint64_t id);
 // nothing past U+10FFFF).
 bool isUTF8(std::string_view text);
 
+// Walks the services that match, one step per service. A step's non-zero
+// answer ends the walk with it; a registry that changes under the walk ends
+// it with kIOReturnRegistryChanged (the walk is not restarted).
+IOReturn walkDrivers(const cf::Value& matching, const std::function<IOReturn(io_service_t)>& step);
+
 // Files a channel dictionary into the aggregate under the options' nesting.
 IOReturn addChannel(const cf::Value& aggregate, const cf::Value& channel, uint32_t options);
 

@@ -2,9 +2,12 @@
 
 #include <gtest/gtest.h>
 
+#include <thread>
+
 #include "../../tests/temp_dir.h"
 #include "../../tests/test_values.h"
 #include "cf/plist.h"
+#include "ioreport/internal.h"
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
@@ -450,6 +453,37 @@ TEST_F(IOReportRegistryTest, Selections) {
   EXPECT_EQ(last.Get("LegendChannel"), cf::Value(cf::Array({cf::Value::SInt64(0x4142), cf::Value::SInt64(0)})));
   EXPECT_EQ(IOReportChannelGetDriverID(last), 0x50);
   EXPECT_EQ(IOReportChannelGetChannelName(last), "AB");
+  EXPECT_EQ(platform::OpenIOObjectCount(), 0u);
+}
+
+TEST_F(IOReportRegistryTest, DriverWalksStopAtAFailureOrARegistryChange) {
+  const cf::Value all = IOServiceMatching("Driver");
+  std::vector<uint64_t> seen;
+  const auto visit = [&](io_service_t driver) {
+    uint64_t id = 0;
+    IORegistryEntryGetRegistryEntryID(driver, &id);
+    seen.push_back(id);
+    return kIOReturnSuccess;
+  };
+  EXPECT_EQ(ioreport_internal::walkDrivers(all, visit), kIOReturnSuccess);
+  EXPECT_EQ(seen, (std::vector<uint64_t>{0x10, 0x20, 0x30, 0x40, 0x50}));
+  seen.clear();
+  EXPECT_EQ(ioreport_internal::walkDrivers(all, [&](io_service_t driver) {
+              visit(driver);
+              return seen.size() == 2 ? kIOReturnNotFound : kIOReturnSuccess;
+            }),
+            kIOReturnNotFound);
+  EXPECT_EQ(seen.size(), 2u);
+  // The registry changes after the first driver: the walk ends there and is not restarted.
+  seen.clear();
+  EXPECT_EQ(ioreport_internal::walkDrivers(all, [&](io_service_t driver) {
+              visit(driver);
+              std::this_thread::sleep_for(std::chrono::milliseconds(2));
+              WriteRegistry(cf::Array({Driver("Late", 0x60, Dict({}))}));
+              return kIOReturnSuccess;
+            }),
+            kIOReturnRegistryChanged);
+  EXPECT_EQ(seen, (std::vector<uint64_t>{0x10}));
   EXPECT_EQ(platform::OpenIOObjectCount(), 0u);
 }
 

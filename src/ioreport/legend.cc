@@ -6,13 +6,8 @@
 #include "ioreport/internal.h"
 #include "ioreport/ioreport.h"
 
-using namespace ioreport_internal;
+namespace ioreport_internal {
 
-namespace {
-
-// Walks the services that match, one step per service. A step's non-zero
-// answer ends the walk with it; a registry that changes under the walk ends
-// it with kIOReturnRegistryChanged (the walk is not restarted).
 IOReturn walkDrivers(const cf::Value& matching, const std::function<IOReturn(io_service_t)>& step) {
   io_iterator_t iterator = 0;
   if (const IOReturn rc = IOServiceGetMatchingServices(kIOMainPortDefault, matching, &iterator); rc != kIOReturnSuccess)
@@ -29,6 +24,12 @@ IOReturn walkDrivers(const cf::Value& matching, const std::function<IOReturn(io_
   IOObjectRelease(iterator);
   return result;
 }
+
+}  // namespace ioreport_internal
+
+using namespace ioreport_internal;
+
+namespace {
 
 cf::Value newChannel(uint64_t driverID, const cf::Value& driverName, const cf::Value& legendChannel,
                      const cf::Value& group, const cf::Value& subgroup, const cf::Value& info) {
