@@ -1,8 +1,10 @@
 // Writes a small seed corpus for every fuzz target, made by the encoders.
 #include <cstdio>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <string>
+#include <vector>
 
 #include "cf/plist.h"
 #include "platform/service.h"
@@ -220,5 +222,51 @@ int main(int argc, char** argv) {
   Seed("telemetry", "one-byte-short", telemetry(0x00, 2, two.substr(0, two.size() - 1)));
   Seed("telemetry", "no-buses", telemetry(0x00, 0, ""));
   Seed("telemetry", "negative-count", telemetry(0x01, 0xFFFFFFFF, two));
+
+  // Legends and hub buffers: options, legend length, legend, then elements.
+  auto element = [](uint64_t driver, uint64_t id, uint64_t type, std::vector<int64_t> values) {
+    std::string e(64, '\0');
+    std::memcpy(e.data(), &driver, 8);
+    std::memcpy(e.data() + 8, &id, 8);
+    std::memcpy(e.data() + 16, &type, 8);
+    for (size_t i = 0; i < values.size() && i < 4; ++i) std::memcpy(e.data() + 32 + 8 * i, &values[i], 8);
+    return e;
+  };
+  auto legend_channel = [](int64_t id, uint64_t type, const char* name) {
+    cf::Array c({cf::Value::SInt64(id), cf::Value::SInt64(static_cast<int64_t>(type))});
+    if (name) c.Append(name);
+    return cf::Value(c);
+  };
+  constexpr uint64_t kSimple = 1 | (0x100ull << 16) | (1ull << 32), kState = 2 | (2ull << 32),
+                     kHistogram = 3 | (3ull << 32), kArray = 4 | (2ull << 32);
+  cf::Dictionary energy;
+  energy.Set("IOReportGroupName", "G");
+  energy.Set("IOReportSubGroupName", "g");
+  cf::Dictionary info;
+  info.Set("IOReportChannelUnit", cf::Value::SInt64(0x0100007c00000000));
+  const int32_t segments[] = {10, 0, 0, 2, 2, 1, 1, 1};
+  info.Set("IOReportChannelConfig", cf::Value::Bytes(cf::Data(reinterpret_cast<const uint8_t*>(segments),
+                                                              reinterpret_cast<const uint8_t*>(segments) + 32)));
+  energy.Set("IOReportChannelInfo", info);
+  energy.Set("IOReportChannels", cf::Array({legend_channel(1, kSimple, "Total"), legend_channel(0x4F4E, kState, nullptr),
+                                            legend_channel(3, kHistogram, "Latency"), legend_channel(4, kArray, "Lanes"),
+                                            legend_channel(5, 0, nullptr)}));
+  cf::Dictionary orphan;
+  orphan.Set("IOReportSubGroupName", "x");
+  orphan.Set("IOReportChannels", cf::Array({legend_channel(6, kSimple, "Never")}));
+  const std::string legend = xml(cf::Array({cf::Value(energy), cf::Value(orphan)}));
+  std::string hub = element(0x10, 1, kSimple, {250}) + element(0x10, 0x4F4E, kState, {0x4F4E, 1, 30}) +
+                    element(0x10, 0x4F4E, kState, {0x4F4646, 2, 10});
+  for (int i = 0; i < 3; ++i) hub += element(0x10, 3, kHistogram, {i, 5, 9, 5 * i});
+  hub += element(0x10, 4, kArray, {1, 2, 3, 4}) + element(0x10, 4, kArray, {5, 6, 7, 8}) +
+         element(0x10, 5, kSimple, {9});
+  auto input = [&](char options, const std::string& list, const std::string& raw) {
+    return std::string(1, options) + BigEndian(list.size(), 2) + list + raw;
+  };
+  for (char options : {'\0', '\3'}) Seed("ioreport_legend", std::string("by-") + char('0' + options), input(options, legend, hub));
+  Seed("ioreport_legend", "short-buffer", input('\1', legend, hub.substr(0, 100)));
+  Seed("ioreport_legend", "overrun", input('\2', legend, element(0x10, 1, 1 | (9ull << 32), {1})));
+  Seed("ioreport_legend", "zero-elements", input('\0', legend, element(0x10, 7, 1, {1}) + hub));
+  Seed("ioreport_legend", "not-a-legend", input('\0', xml(info), hub));
   return 0;
 }

@@ -11,7 +11,7 @@
 #include <utility>
 
 #include "collect/datausage.h"
-
+#include "collect/ioreport_keys.h"
 #include "nandinfo/nandinfo.h"
 #include "platform/diagnostics.h"
 #include "platform/log.h"
@@ -97,10 +97,6 @@ void CollectDataUsage() {
   });
   if (!done->try_acquire_for(std::chrono::seconds(10))) LogDefault("Vitalis timed out, no datausage available");
 }
-
-// Step 6: the reporting channels of the field category. (A seam until the
-// reporting channels are built.)
-void CollectReportingChannels() {}
 
 }  // namespace
 

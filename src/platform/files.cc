@@ -410,6 +410,14 @@ bool AppendToFile(const std::string& path, std::string_view bytes, std::string* 
   return dir && dir->Append(LeafOf(path), bytes, error);
 }
 
+ssize_t WriteToDescriptor(int fd, std::string_view bytes) {
+  ssize_t n;
+  do {
+    n = write(fd, bytes.data(), bytes.size());
+  } while (n < 0 && errno == EINTR);
+  return n;
+}
+
 bool IsLeftoverTempName(std::string_view name) {
   auto six_alnum = [](std::string_view s) {
     if (s.size() != 6) return false;

@@ -99,6 +99,10 @@ bool WriteFileAtomically(const std::string& path, std::string_view bytes, std::s
 // Appends bytes to path in one write (see Directory::Append).
 bool AppendToFile(const std::string& path, std::string_view bytes, std::string* error = nullptr);
 
+// One write(2) of bytes to an open descriptor, again after an interruption:
+// the count written, or -1 with errno set.
+ssize_t WriteToDescriptor(int fd, std::string_view bytes);
+
 // True for the names of the temporary files this layer makes (and of those
 // older versions made); the next run removes them.
 bool IsLeftoverTempName(std::string_view name);

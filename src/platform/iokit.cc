@@ -256,3 +256,7 @@ kern_return_t IOConnectMapMemory64(io_connect_t connect, uint32_t memoryType, ta
   *ofSize = bytes.size();
   return kIOReturnSuccess;
 }
+
+kern_return_t IOConnectUnmapMemory64(io_connect_t connect, uint32_t, task_port_t, mach_vm_address_t) {
+  return Model().Get(connect, Kind::kConnection) ? kIOReturnSuccess : kIOReturnBadArgument;
+}

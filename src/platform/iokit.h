@@ -82,6 +82,10 @@ kern_return_t IOConnectCallScalarMethod(io_connect_t connection, uint32_t select
 // that stay valid until the next call on the connection or its close.
 kern_return_t IOConnectMapMemory64(io_connect_t connect, uint32_t memoryType, task_port_t intoTask,
                                    mach_vm_address_t* atAddress, mach_vm_size_t* ofSize, uint32_t options);
+// Ends a mapping made by IOConnectMapMemory64. The bytes belong to the
+// client, so this only checks that the connection is open.
+kern_return_t IOConnectUnmapMemory64(io_connect_t connect, uint32_t memoryType, task_port_t fromTask,
+                                     mach_vm_address_t atAddress);
 
 namespace platform {
 // How many objects are open in the current context (tests check for leaks).

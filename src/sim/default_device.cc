@@ -1,5 +1,6 @@
 #include "sim/default_device.h"
 
+#include <cstring>
 #include <iterator>
 #include <map>
 #include <string>
@@ -153,6 +154,29 @@ cf::Dictionary TelemetryFields(uint32_t mode) {
   return Entry({{"buses", buses}});
 }
 
+// A legend channel: ID, type (format, categories, element count), name.
+cf::Value LegendChannel(int64_t id, uint8_t format, uint16_t categories, uint16_t elements, const char* name) {
+  cf::Array channel({cf::Value::SInt64(id),
+                     cf::Value::SInt64(static_cast<int64_t>(format | (uint64_t{categories} << 16) |
+                                                            (uint64_t{elements} << 32)))});
+  if (name) channel.Append(name);
+  return channel;
+}
+
+// One linear segment of a histogram's configuration: buckets of width.
+cf::Value HistogramConfig(uint32_t width, int32_t buckets) {
+  uint8_t segment[16] = {};
+  std::memcpy(segment, &width, 4);
+  std::memcpy(segment + 12, &buckets, 4);
+  return cf::Value::Bytes(cf::Data(segment, segment + 16));
+}
+
+cf::Value Values(std::initializer_list<int64_t> values) {
+  cf::Array a;
+  for (int64_t v : values) a.Append(cf::Value::SInt64(v));
+  return a;
+}
+
 }  // namespace
 
 DefaultDevice DefaultStorageDevice() {
@@ -169,7 +193,67 @@ DefaultDevice DefaultStorageDevice() {
              {"parent", cf::Value::UInt64(0x100000100)},
              {"userClient", "nvme"},
              {"properties", Entry({{"Controller Characteristics", characteristics}})}}),
+      // The reporting hub and two drivers that publish reporting channels:
+      // simple ones of the field category become the daily ioreport keys,
+      // the state, histogram and other-category ones do not.
+      Entry({{"class", "IOReportHub"},
+             {"name", "IOReportHub"},
+             {"id", cf::Value::UInt64(0x100000B00)},
+             {"parent", cf::Value::UInt64(0x100000100)},
+             {"userClient", "hub"}}),
+      Entry({{"class", "PowerManager"},
+             {"name", "pmgr"},
+             {"id", cf::Value::UInt64(0x100000B10)},
+             {"parent", cf::Value::UInt64(0x100000100)},
+             {"properties",
+              Entry({{"IOReportLegendPublic", cf::Value::Bool(true)},
+                     {"IOReportLegend",
+                      cf::Array({Entry({{"IOReportGroupName", "Energy Model"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0300007c00000000)}})},
+                                        {"IOReportChannels",
+                                         cf::Array({LegendChannel(0x43505530, 1, 0x0100, 1, nullptr),
+                                                    LegendChannel(2, 1, 0x0100, 1, "GPUEnergy")})}}),
+                                 Entry({{"IOReportGroupName", "CPU States"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0100007900000000)}})},
+                                        {"IOReportChannels",
+                                         cf::Array({LegendChannel(3, 2, 0x0100, 3, "PerformanceStates")})}})})}})}}),
+      Entry({{"class", "StorageReporter"},
+             {"name", "nvme-report"},
+             {"id", cf::Value::UInt64(0x100000B20)},
+             {"parent", cf::Value::UInt64(0x100000A2F)},
+             {"properties",
+              Entry({{"IOReportLegendPublic", cf::Value::Bool(true)},
+                     {"IOReportLegend",
+                      cf::Array({Entry({{"IOReportGroupName", "Storage"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0900960000000000)}})},
+                                        {"IOReportChannels", cf::Array({LegendChannel(1, 1, 0x0100, 1, "HostReadMiB")})}}),
+                                 Entry({{"IOReportGroupName", "Storage"},
+                                        {"IOReportChannels", cf::Array({LegendChannel(2, 1, 0x0002, 1, "QueueDepth")})}}),
+                                 // Read latency in microseconds, four buckets of 100.
+                                 Entry({{"IOReportGroupName", "Storage"},
+                                        {"IOReportSubGroupName", "Latency"},
+                                        {"IOReportChannelInfo",
+                                         Entry({{"IOReportChannelUnit", cf::Value::SInt64(0x0100007900000000)},
+                                                {"IOReportChannelConfig", HistogramConfig(100, 4)}})},
+                                        {"IOReportChannels",
+                                         cf::Array({LegendChannel(3, 3, 0x0100, 4, "ReadLatency")})}})})}})}}),
   });
+  // Values of the hub's channels: driver entry ID → channel ID → value, or
+  // one [v0, v1, v2, v3] per element.
+  device.ioreport = Entry(
+      {{"4294970128",
+        Entry({{"1129338160", cf::Value::SInt64(52840)},
+               {"2", cf::Value::SInt64(1200)},
+               {"3", cf::Array({Values({0x4F4646, 40, 61200000}), Values({0x4C4F57, 310, 18000000}),
+                                Values({0x48494748, 275, 7200000})})}})},
+       {"4294970144",
+        Entry({{"1", cf::Value::SInt64(30512)},
+               {"2", cf::Value::SInt64(7)},
+               {"3", cf::Array({Values({120, 20, 95, 7600}), Values({40, 105, 198, 5800}), Values({3, 210, 290, 750}),
+                                Values({0, 0, 0, 0})})}})}});
   device.controller = Entry({{"stats", FtlFields()},
                              {"msp", cf::Array({MspFields(0), MspFields(1)})},
                              {"bandStats", ValidityList()},

@@ -3,7 +3,8 @@
 // kind and its answers (every FTL field, two MSP buffers, the validity and
 // defects lists and the telemetry list of each of the three modes), a
 // stackshot with the memory freezer's thread, a purgeable-space answer,
-// pending ECC events and the boot session's id.
+// pending ECC events, the boot session's id, and a reporting hub with two
+// drivers' channels.
 #pragma once
 
 #include <string>
@@ -18,6 +19,7 @@ struct DefaultDevice {
   cf::Value stackshot;   // device/stackshot.plist
   cf::Value purgeable;   // device/purgeable.plist
   cf::Value ecc_events;  // device/ecc-events.plist
+  cf::Value ioreport;    // device/ioreport.plist
   std::string boot_session_uuid;  // "kern.bootsessionuuid" of device/sysctl.plist
 };
 DefaultDevice DefaultStorageDevice();

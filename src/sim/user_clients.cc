@@ -14,6 +14,7 @@ struct Kind {
 // One line per kind: the "userClient" value of registry.plist and its class.
 constexpr Kind kKinds[] = {
     {"nvme", &CreateNvmeClient},
+    {"hub", &CreateHubClient},
 };
 
 }  // namespace

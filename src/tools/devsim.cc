@@ -1,9 +1,10 @@
 // devsim: the simulated device's tools. `devsim init DIR` writes a complete
-// default device root.
+// default device root; the others show what a root's devices give.
 
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
+#include <unistd.h>
 #include <vector>
 #include <filesystem>
 #include <string>
@@ -12,6 +13,8 @@
 #include "tools/cli.h"
 #include "platform/files.h"
 #include "cf/plist.h"
+#include "ioreport/ioreport.h"
+#include "ioreport/samples.h"
 #include "nandinfo/nandinfo.h"
 #include "platform/context.h"
 #include "tools/default_root.h"
@@ -126,6 +129,39 @@ int Controller(const std::string& root) {
   return 0;
 }
 
+// Every reporting channel of the root with one sample of it: the channel's
+// line, then its values indented, for people checking a device. Drivers
+// whose legends cannot be read are named on stderr.
+int Reporting(const std::string& root) {
+  platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  const std::string& where = scope.context().root();
+  std::optional<IOReportError> error;
+  const auto fail = [&](const char* what) {
+    std::fprintf(stderr, "devsim: %s: %s: %s\n", where.c_str(), what,
+                 error ? error->Description().c_str() : "no reason given");
+    return 1;
+  };
+  const cf::Value channels = IOReportCopyAllChannels(kIOReportByDriver | kIOReportPrintFailedDrivers, &error);
+  if (channels.IsNull()) return fail("the reporting channels could not be listed");
+  if (IOReportGetChannelCount(channels) == 0) {
+    std::fprintf(stderr, "devsim: %s has no reporting channels\n", where.c_str());
+    return 1;
+  }
+  cf::Value subscribed;
+  const IOReportSubscriptionRef subscription = IOReportCreateSubscription(nullptr, channels, &subscribed, 0, &error);
+  if (!subscription) return fail("the reporting hub could not be subscribed to");
+  const cf::Value samples = IOReportCreateSamples(subscription, subscribed, &error);
+  if (samples.IsNull()) return fail("the reporting channels could not be sampled");
+  IOReturn written = kIOReturnSuccess;
+  IOReportIterate(samples, [&](const cf::Dictionary& sample) {
+    for (const cf::Value& text :
+         {IOReportChannelCopyDescription(sample, {}, ""), IOReportSampleCopyDescription(sample, {}, "  ")})
+      if (!text.IsNull() && written == kIOReturnSuccess) written = IOReportWriteStringUTF8(STDOUT_FILENO, text);
+    return written == kIOReturnSuccess ? kIOReportIterOk : kIOReportIterFailed;
+  });
+  return written == kIOReturnSuccess ? 0 : 1;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -143,6 +179,9 @@ int main(int argc, char** argv) {
   std::string controller_root;
   auto* controller = app.add_subcommand("controller", "Print the NAND info a root's controller gives, as JSON");
   controller->add_option("ROOT", controller_root, "the device root (default: TALLYRUN_ROOT)");
+  std::string reporting_root;
+  auto* reporting = app.add_subcommand("ioreport", "Print a root's reporting channels with one sample of them");
+  reporting->add_option("ROOT", reporting_root, "the device root (default: TALLYRUN_ROOT)");
   auto* snapshot = app.add_subcommand("snapshot", "Print a snapshot buffer as text");
   snapshot->add_option("FILE", file)->required();
   snapshot->add_option("--header", header_file, "the snapshot header, for the descriptor-driven form");
@@ -150,6 +189,7 @@ int main(int argc, char** argv) {
   if (parse->parsed()) return Parse(kind, file);
   if (snapshot->parsed()) return Snapshot(file, header_file);
   if (controller->parsed()) return Controller(controller_root);
+  if (reporting->parsed()) return Reporting(reporting_root);
   if (init->parsed()) {
     std::error_code ec;
     if (std::filesystem::exists(dir, ec) && !std::filesystem::is_directory(dir, ec)) {

@@ -1,8 +1,9 @@
 // The daily collection's own keys and records through whole runs: disk
-// usage, the kernel's ECC events, network data usage and the storage
-// structured log.
+// usage, the kernel's ECC events, network data usage, the storage
+// structured log and the reporting channels.
 #include "../records.h"
 #include "../test_values.h"
+#include "sim/default_device.h"
 #include "root_fixture.h"
 
 namespace {
@@ -146,6 +147,82 @@ TEST_F(CollectRun, LateRepliesStillCount) {
   r = Serve({{"run-day", std::to_string(kToday - 1)}});
   EXPECT_EQ(Count(r.err, "<default>: Vitalis timed out, no datausage available\n"), 1u) << r.err;
   EXPECT_EQ(Scalar("datausage.wwanOutKB.com.velmora.P"), "20");
+}
+
+TEST_F(CollectRun, TheDefaultDevicesSimpleFieldChannelsBecomeKeys) {
+  RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.ioreport.CPU0"), "52840") << r.err;  // named by its ID
+  EXPECT_EQ(Scalar("com.velmora.ioreport.GPUEnergy"), "1200");
+  EXPECT_EQ(Scalar("com.velmora.ioreport.HostReadMiB"), "30512");
+  EXPECT_EQ(Scalar("com.velmora.ioreport.QueueDepth"), "(missing)");  // not the field category
+  EXPECT_EQ(Scalar("com.velmora.ioreport.PerformanceStates"), "(missing)");
+  EXPECT_EQ(Scalar("com.velmora.ioreport.ReadLatency"), "(missing)");
+
+  // A hub whose buffer cannot be refreshed: the values stay as they were
+  // and the rest of the collection still runs.
+  WritePlist("device/ioreport.plist", Dict({{"4294970144", Dict({{"1", cf::Value::SInt64(31000)}})}}));
+  cf::Array registry = sim::DefaultStorageDevice().registry.AsArray()->MutableCopy();
+  for (size_t i = 0; i < registry.size(); ++i) {
+    cf::Dictionary service = registry[i].AsDictionary()->MutableCopy();
+    if (service.Get("class") == cf::Value("IOReportHub"))
+      service.Set("properties", Dict({{"failSelectors", cf::Array({cf::Value::SInt64(3)})}}));
+    registry.Set(i, service);
+  }
+  WritePlist("device/registry.plist", registry);
+  WritePlist("device/answers.plist",
+             Dict({{"DiskUsage", Dict({{"TotalDiskCapacity", cf::Value::SInt64(64000000000)}})}}));
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.ioreport.HostReadMiB"), "30512") << r.err;
+  EXPECT_EQ(Scalar("com.velmora.homedeck.DiskUsageUserTotalBlocks"), "61035");
+  // Working again, the day's value is replaced.
+  WritePlist("device/registry.plist", sim::DefaultStorageDevice().registry);
+  r = Tallyrun({"-f"});
+  EXPECT_EQ(Scalar("com.velmora.ioreport.HostReadMiB"), "31000") << r.err;
+  EXPECT_EQ(Scalar("com.velmora.ioreport.CPU0"), "0");  // no longer in the file
+}
+
+std::string Right(size_t width, const std::string& text) {
+  return std::string(width > text.size() ? width - text.size() : 0, ' ') + text;
+}
+
+TEST_F(CollectRun, DevsimShowsEveryChannelWithASample) {
+  RunResult r = RunProgram(DEVSIM_BIN, {"ioreport", root.path()}, env);
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_EQ(r.err, "");
+  const std::string pmgr = "pmgr <id 0x100000b10> ";
+  const std::string expected =
+      pmgr + "CPU0 < 0x43505530 (mJ) | G/g Energy Model/(none) | cat 0x100 | format 0x01 | elts 1 >\n" + "  " +
+      Right(32, "CPU0") + " = { " + Right(12, "52840") + " mJ }\n" + pmgr +
+      "GPUEnergy < 0x2 (mJ) | G/g Energy Model/(none) | cat 0x100 | format 0x01 | elts 1 >\n" + "  " +
+      Right(32, "GPUEnergy") + " = { " + Right(12, "1200") + " mJ }\n" + pmgr +
+      "PerformanceStates < 0x3 (us) | G/g CPU States/(none) | cat 0x100 | format 0x02 | elts 3 >\n" + "  " +
+      Right(20, "PerformanceStates") + "[     OFF] = { # 40       6.120e+01 s / 70.8% }\n" + "  " +
+      Right(20, "PerformanceStates") + "[     LOW] = { # 310      1.800e+01 s / 20.8% }\n" + "  " +
+      Right(20, "PerformanceStates") + "[    HIGH] = { # 275      7.200e+00 s /  8.3% }\n";
+  EXPECT_EQ(r.out.substr(0, expected.size()), expected);
+  const std::string latency = "  " + Right(20, "ReadLatency") + "[" + Right(12, "0") + " - " + Right(12, "100") +
+                              " us] = { m " + Right(12, "20") + "; M " + Right(12, "95") + "; s " + Right(12, "7600") +
+                              "; # " + Right(12, "120") + " }\n";
+  EXPECT_NE(r.out.find(latency), std::string::npos) << r.out;
+  EXPECT_NE(r.out.find("  " + Right(20, "ReadLatency") + "[" + Right(12, "300") + " - " + Right(12, "400") +
+                       " us] = { <no hits>; # 0 }\n"),
+            std::string::npos);
+  EXPECT_NE(r.out.find("nvme-report <id 0x100000b20> QueueDepth < 0x2 ((null)) | G/g Storage/(none) | cat 0x02 |"),
+            std::string::npos);
+
+  // A hub that cannot map its buffer.
+  cf::Array registry = sim::DefaultStorageDevice().registry.AsArray()->MutableCopy();
+  for (size_t i = 0; i < registry.size(); ++i) {
+    cf::Dictionary service = registry[i].AsDictionary()->MutableCopy();
+    if (service.Get("class") == cf::Value("IOReportHub"))
+      service.Set("properties", Dict({{"failMap", cf::Value::Bool(true)}}));
+    registry.Set(i, service);
+  }
+  WritePlist("device/registry.plist", registry);
+  r = RunProgram(DEVSIM_BIN, {"ioreport", root.path()}, env);
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "devsim: " + root.path() +
+                       ": the reporting hub could not be subscribed to: Mach error 0xe00002bc: IOConnectMapMemory() failed\n");
 }
 
 }  // namespace

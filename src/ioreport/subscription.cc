@@ -1,0 +1,205 @@
+// Subscribing through the reporting hub and cutting its buffer into samples.
+#include <cstring>
+#include <vector>
+
+#include "ioreport/internal.h"
+#include "ioreport/samples.h"
+#include "platform/log.h"
+
+using namespace ioreport_internal;
+
+namespace {
+
+// The hub's methods.
+constexpr uint32_t kIOReportUserClientOpen = 0;
+constexpr uint32_t kIOReportUserClientConfigureInterests = 2;
+constexpr uint32_t kIOReportUserClientUpdateKernelBuffer = 3;
+
+// Interest lists of this many entries or more would not fit their size in 32 bits.
+constexpr uint64_t kMaxInterests = 89478478;
+
+uint64_t readU64(const uint8_t* p) {
+  uint64_t v;
+  std::memcpy(&v, p, 8);
+  return v;
+}
+
+void writeU64(uint8_t* p, uint64_t v) { std::memcpy(p, &v, 8); }
+
+// n, then (driver ID, channel ID, type) per channel in walk order; empty on
+// failure.
+std::vector<uint8_t> createInterestList(const cf::Value& channels, int n) {
+  if (n <= 0 || static_cast<uint64_t>(n) >= kMaxInterests) return {};
+  std::vector<uint8_t> list(8 + 24 * static_cast<size_t>(n), 0);
+  const uint32_t count = static_cast<uint32_t>(n);
+  std::memcpy(list.data(), &count, 4);
+  int written = 0;
+  const int r = IOReportIterate(channels, [&](const cf::Dictionary& channel) {
+    const int64_t driver = IOReportChannelGetDriverID(channel);
+    const int64_t id = IOReportChannelGetChannelID(channel);
+    const auto type = channelType(channel);
+    if (driver == kIOReportInvalidValue || id == kIOReportInvalidValue || !type || written >= n)
+      return kIOReportIterFailed;
+    uint8_t* entry = list.data() + 8 + 24 * static_cast<size_t>(written);
+    writeU64(entry, static_cast<uint64_t>(driver));
+    writeU64(entry + 8, static_cast<uint64_t>(id));
+    writeU64(entry + 16, *type);
+    ++written;
+    return kIOReportIterOk;
+  });
+  if ((r & kIOReportIterFailed) || written != n) return {};
+  return list;
+}
+
+void logZeroElements(const cf::Dictionary& channel) {
+  platform::LogError("channel has zero elements! %@ -- %@ -- %@ -- %@", channel.Get("DriverName"),
+                     IOReportChannelGetGroup(channel), IOReportChannelGetSubGroup(channel),
+                     cf::Value(IOReportChannelGetChannelName(channel)));
+}
+
+}  // namespace
+
+IOReportSubscription::~IOReportSubscription() {
+  if (mapped_address) IOConnectUnmapMemory64(connection, static_cast<uint32_t>(buffer_token), mach_task_self(),
+                                             mapped_address);
+  if (connection) IOServiceClose(connection);
+}
+
+IOReportSubscriptionRef IOReportCreateSubscription(const void*, const cf::Value& channels, cf::Value* subscribed,
+                                                   uint64_t, IOReportErrorOut error) {
+  if (channels.IsNull() || !subscribed) {
+    setError(error, kIOReturnBadArgument, "bad arguments");
+    return nullptr;
+  }
+  const int n = IOReportGetChannelCount(channels);
+  if (n <= 0) {
+    setError(error, kIOReturnBadArgument, n < 0 ? "iteration error" : "no channels");
+    return nullptr;
+  }
+  const std::vector<uint8_t> interests = createInterestList(channels, n);
+  if (interests.empty()) {
+    setError(error, kIOReturnNoMemory, "createInterestList() failed");
+    return nullptr;
+  }
+  auto subscription = std::make_shared<IOReportSubscription>();
+  const io_service_t hub = IOServiceGetMatchingService(kIOMainPortDefault, IOServiceMatching("IOReportHub"));
+  if (!hub) {
+    setError(error, kIOReturnNotFound);
+    return nullptr;
+  }
+  io_connect_t connection = 0;
+  IOReturn rc = IOServiceOpen(hub, mach_task_self(), 0, &connection);
+  IOObjectRelease(hub);
+  if (rc != kIOReturnSuccess) {
+    setError(error, rc, "Could not open IOReportHub");
+    return nullptr;
+  }
+  subscription->connection = connection;  // closed with the object from here on
+  rc = IOConnectCallScalarMethod(connection, kIOReportUserClientOpen, nullptr, 0, nullptr, nullptr);
+  if (rc != kIOReturnSuccess) {
+    setError(error, rc, "kIOReportUserClientOpen failed");
+    return nullptr;
+  }
+  uint64_t token = 0;
+  uint32_t outputs = 1;
+  rc = IOConnectCallMethod(connection, kIOReportUserClientConfigureInterests, nullptr, 0, interests.data(),
+                           interests.size(), &token, &outputs, nullptr, nullptr);
+  if (rc == kIOReturnSuccess && outputs != 1) rc = kIOReturnError;
+  if (rc != kIOReturnSuccess) {
+    setError(error, rc, "kIOReportUserClientConfigureInterests failed");
+    return nullptr;
+  }
+  subscription->buffer_token = token;
+  rc = IOConnectMapMemory64(connection, static_cast<uint32_t>(token), mach_task_self(),
+                            &subscription->mapped_address, &subscription->mapped_size, kIOMapAnywhere);
+  if (rc != kIOReturnSuccess) {
+    subscription->mapped_address = 0;
+    setError(error, rc, "IOConnectMapMemory() failed");
+    return nullptr;
+  }
+  int r = 0;
+  *subscribed = copyChannels(channels, [](const cf::Dictionary&, cf::Dictionary&) { return kIOReportIterOk; }, &r);
+  return subscription;
+}
+
+cf::Value IOReportCreateSamples(const IOReportSubscriptionRef& subscription, const cf::Value& subscribed,
+                                IOReportErrorOut error) {
+  if (!subscription || subscribed.IsNull()) {
+    setError(error, kIOReturnBadArgument);
+    return cf::Value();
+  }
+  const uint64_t token = subscription->buffer_token;
+  const IOReturn rc = IOConnectCallScalarMethod(subscription->connection, kIOReportUserClientUpdateKernelBuffer,
+                                                &token, 1, nullptr, nullptr);
+  if (rc != kIOReturnSuccess) {
+    setError(error, rc, "_updateKernelBuffer() failed");
+    return cf::Value();
+  }
+  const std::string_view bytes(reinterpret_cast<const char*>(subscription->mapped_address),
+                               subscription->mapped_address ? subscription->mapped_size : 0);
+  cf::Value samples = createSamplesFromBytes(subscribed, bytes, error);
+  if (samples.IsNull()) setErrorIfEmpty(error, kIOReturnError, "unknown error");
+  return samples;
+}
+
+cf::Value IOReportCreateSamplesRaw(const cf::Value& channels, const cf::Value& raw, IOReportErrorOut error) {
+  const cf::Data* data = raw.AsData();
+  if (channels.IsNull() || !data) {
+    setError(error, kIOReturnBadArgument);
+    return cf::Value();
+  }
+  return createSamplesFromBytes(channels, std::string_view(reinterpret_cast<const char*>(data->data()), data->size()),
+                                error);
+}
+
+cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw, IOReportErrorOut error) {
+  if (raw.size() < kIOReportElementSize) {
+    setError(error, kIOReturnBadArgument, "couldn't create samples");
+    return cf::Value();
+  }
+  const auto* base = reinterpret_cast<const uint8_t*>(raw.data());
+  // Trailing bytes short of a whole element are not read.
+  const size_t usable = raw.size() / kIOReportElementSize * kIOReportElementSize;
+  int r = 0;
+  cf::Value samples = copyChannels(
+      channels,
+      [&](const cf::Dictionary& channel, cf::Dictionary& copy) {
+        const uint64_t driver = static_cast<uint64_t>(IOReportChannelGetDriverID(channel));
+        const uint64_t id = static_cast<uint64_t>(IOReportChannelGetChannelID(channel));
+        for (size_t at = 0; at + kIOReportElementSize <= usable;) {
+          const uint8_t* record = base + at;
+          const uint64_t type = readU64(record + 16);
+          const size_t count = (type >> 32) & 0xFFFF;
+          if (count == 0) {
+            logZeroElements(channel);
+            return kIOReportIterSkipped;
+          }
+          const size_t length = count * kIOReportElementSize;
+          if (readU64(record) != driver || readU64(record + 8) != id) {
+            at += length;
+            continue;
+          }
+          if (IOReportChannelGetFormat(channel) == kIOReportFormatUnknown) {
+            // Channels asked for by ID learn their type from the first sample.
+            if (const cf::Array* legend = channel.Get("LegendChannel").AsArray()) {
+              cf::Array learned = legend->MutableCopy();
+              if (learned.size() >= 2) learned.Set(1, cf::Value::SInt64(static_cast<int64_t>(type)));
+              copy.Set("LegendChannel", learned);
+            }
+          }
+          if (length > usable - at) {
+            platform::LogFault("absurd element count! nelems=%d, %@ -- %@ -- %@ -- %@", static_cast<int>(count),
+                               channel.Get("DriverName"), IOReportChannelGetGroup(channel),
+                               IOReportChannelGetSubGroup(channel), cf::Value(IOReportChannelGetChannelName(channel)));
+            setErrorIfEmpty(error, kIOReturnError, "absurd element count");
+            return kIOReportIterFailed;
+          }
+          copy.Set("RawElements", cf::Value::Bytes(cf::Data(record, record + length)));
+          return kIOReportIterOk;
+        }
+        return kIOReportIterSkipped;
+      },
+      &r);
+  if (samples.IsNull()) setErrorIfEmpty(error, kIOReturnBadArgument, "couldn't create samples");
+  return samples;
+}
