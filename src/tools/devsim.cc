@@ -1,22 +1,25 @@
 // devsim: the simulated device's tools. `devsim init DIR` writes a complete
 // default device root; the others show what a root's devices give.
 
+#include <unistd.h>
+
 #include <algorithm>
+#include <chrono>
 #include <cstdio>
 #include <cstring>
-#include <unistd.h>
-#include <vector>
 #include <filesystem>
 #include <string>
+#include <thread>
+#include <vector>
 
-#include "parsers/parsers.h"
-#include "tools/cli.h"
-#include "platform/files.h"
 #include "cf/plist.h"
 #include "ioreport/ioreport.h"
 #include "ioreport/samples.h"
 #include "nandinfo/nandinfo.h"
+#include "parsers/parsers.h"
 #include "platform/context.h"
+#include "platform/files.h"
+#include "tools/cli.h"
 #include "tools/default_root.h"
 
 namespace {
@@ -129,10 +132,59 @@ int Controller(const std::string& root) {
   return 0;
 }
 
-// Every reporting channel of the root with one sample of it: the channel's
-// line, then its values indented, for people checking a device. Drivers
-// whose legends cannot be read are named on stderr.
-int Reporting(const std::string& root) {
+// One channel's change between two samples, for --json.
+cf::Dictionary ChannelDelta(const cf::Dictionary& sample) {
+  cf::Dictionary out;
+  out.Set("driver", IOReportChannelGetDriverName(sample));
+  out.Set("driverID", cf::Value::SInt64(IOReportChannelGetDriverID(sample)));
+  out.Set("group", IOReportChannelGetGroup(sample));
+  out.Set("subgroup", IOReportChannelGetSubGroup(sample));
+  out.Set("channel", IOReportChannelGetChannelName(sample));
+  out.Set("channelID", cf::Value::SInt64(IOReportChannelGetChannelID(sample)));
+  out.Set("categories", cf::Value::SInt64(IOReportChannelGetCategories(sample)));
+  out.Set("unit", IOReportChannelGetUnitLabel(sample));
+  cf::Array values;
+  switch (IOReportChannelGetFormat(sample)) {
+    case kIOReportFormatSimple:
+      out.Set("format", "simple");
+      out.Set("delta", cf::Value::SInt64(IOReportSimpleGetIntegerValue(sample, nullptr)));
+      return out;
+    case kIOReportFormatSimpleArray:
+      out.Set("format", "array");
+      for (int i = 0; IOReportArrayGetValueAtIndex(sample, i) != kIOReportInvalidValue; ++i)
+        values.Append(cf::Value::SInt64(IOReportArrayGetValueAtIndex(sample, i)));
+      break;
+    case kIOReportFormatState:
+      out.Set("format", "state");
+      for (int i = 0; i < IOReportStateGetCount(sample); ++i) {
+        cf::Dictionary state;
+        state.Set("name", IOReportStateGetNameForIndex(sample, i));
+        state.Set("transitions", cf::Value::SInt64(IOReportStateGetInTransitions(sample, i)));
+        state.Set("residency", cf::Value::SInt64(IOReportStateGetResidency(sample, i)));
+        values.Append(state);
+      }
+      break;
+    case kIOReportFormatHistogram:
+      out.Set("format", "histogram");
+      for (int i = 0; i < IOReportHistogramGetBucketCount(sample); ++i) {
+        cf::Dictionary bucket;
+        bucket.Set("hits", cf::Value::SInt64(IOReportHistogramGetBucketHits(sample, i)));
+        bucket.Set("sum", cf::Value::SInt64(IOReportHistogramGetBucketSum(sample, i)));
+        values.Append(bucket);
+      }
+      break;
+    default: out.Set("format", "unknown");
+  }
+  out.Set("delta", values);
+  return out;
+}
+
+// The reporting channels of a root (all, or those of some categories) and
+// what changed in them between two samples taken interval seconds apart:
+// each channel's line, then its values indented; or the same as JSON. For
+// people checking a device. Drivers whose legends cannot be read are named
+// on stderr.
+int Reporting(const std::string& root, int64_t categories, bool json, double interval) {
   platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
   const std::string& where = scope.context().root();
   std::optional<IOReportError> error;
@@ -141,19 +193,39 @@ int Reporting(const std::string& root) {
                  error ? error->Description().c_str() : "no reason given");
     return 1;
   };
-  const cf::Value channels = IOReportCopyAllChannels(kIOReportByDriver | kIOReportPrintFailedDrivers, &error);
+  const uint32_t options = kIOReportByDriver | kIOReportPrintFailedDrivers;
+  const cf::Value channels = categories < 0 ? IOReportCopyAllChannels(options, &error)
+                                            : IOReportCopyChannelsInCategories(static_cast<uint16_t>(categories),
+                                                                               options, &error);
   if (channels.IsNull()) return fail("the reporting channels could not be listed");
   if (IOReportGetChannelCount(channels) == 0) {
-    std::fprintf(stderr, "devsim: %s has no reporting channels\n", where.c_str());
+    std::fprintf(stderr, "devsim: %s has no reporting channels%s\n", where.c_str(),
+                 categories < 0 ? "" : " in those categories");
     return 1;
   }
   cf::Value subscribed;
   const IOReportSubscriptionRef subscription = IOReportCreateSubscription(nullptr, channels, &subscribed, 0, &error);
   if (!subscription) return fail("the reporting hub could not be subscribed to");
-  const cf::Value samples = IOReportCreateSamples(subscription, subscribed, &error);
-  if (samples.IsNull()) return fail("the reporting channels could not be sampled");
+  const cf::Value first = IOReportCreateSamples(subscription, subscribed, &error);
+  if (first.IsNull()) return fail("the reporting channels could not be sampled");
+  std::this_thread::sleep_for(std::chrono::duration<double>(interval));
+  const cf::Value second = IOReportCreateSamples(subscription, subscribed, &error);
+  if (second.IsNull()) return fail("the reporting channels could not be sampled");
+  const cf::Value delta = IOReportCreateSamplesDelta(first, second, &error);
+  if (delta.IsNull()) return fail("the two samples could not be compared");
+  if (json) {
+    cf::Array out;
+    IOReportIterate(delta, [&](const cf::Dictionary& sample) {
+      out.Append(ChannelDelta(sample));
+      return kIOReportIterOk;
+    });
+    std::string text;
+    if (!cf::WriteJSON(out, text, nullptr, 2)) return fail("the channels could not be written as JSON");
+    std::printf("%s\n", text.c_str());
+    return std::fflush(stdout) == 0 ? 0 : 1;
+  }
   IOReturn written = kIOReturnSuccess;
-  IOReportIterate(samples, [&](const cf::Dictionary& sample) {
+  IOReportIterate(delta, [&](const cf::Dictionary& sample) {
     for (const cf::Value& text :
          {IOReportChannelCopyDescription(sample, {}, ""), IOReportSampleCopyDescription(sample, {}, "  ")})
       if (!text.IsNull() && written == kIOReturnSuccess) written = IOReportWriteStringUTF8(STDOUT_FILENO, text);
@@ -180,8 +252,17 @@ int main(int argc, char** argv) {
   auto* controller = app.add_subcommand("controller", "Print the NAND info a root's controller gives, as JSON");
   controller->add_option("ROOT", controller_root, "the device root (default: TALLYRUN_ROOT)");
   std::string reporting_root;
-  auto* reporting = app.add_subcommand("ioreport", "Print a root's reporting channels with one sample of them");
+  int64_t categories = -1;
+  bool reporting_json = false;
+  double interval = 1;
+  auto* reporting =
+      app.add_subcommand("ioreport", "Print a root's reporting channels and their change over a second");
   reporting->add_option("ROOT", reporting_root, "the device root (default: TALLYRUN_ROOT)");
+  reporting->add_option("--category", categories, "only channels of these categories (a mask, e.g. 0x100)")
+      ->check(CLI::Range(int64_t{0}, int64_t{0xFFFF}));
+  reporting->add_flag("--json", reporting_json, "print the channels and their change as JSON");
+  reporting->add_option("--interval", interval, "seconds between the two samples (default 1)")
+      ->check(CLI::Range(0.0, 3600.0));
   auto* snapshot = app.add_subcommand("snapshot", "Print a snapshot buffer as text");
   snapshot->add_option("FILE", file)->required();
   snapshot->add_option("--header", header_file, "the snapshot header, for the descriptor-driven form");
@@ -189,7 +270,7 @@ int main(int argc, char** argv) {
   if (parse->parsed()) return Parse(kind, file);
   if (snapshot->parsed()) return Snapshot(file, header_file);
   if (controller->parsed()) return Controller(controller_root);
-  if (reporting->parsed()) return Reporting(reporting_root);
+  if (reporting->parsed()) return Reporting(reporting_root, categories, reporting_json, interval);
   if (init->parsed()) {
     std::error_code ec;
     if (std::filesystem::exists(dir, ec) && !std::filesystem::is_directory(dir, ec)) {

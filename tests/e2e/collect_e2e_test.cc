@@ -1,6 +1,9 @@
 // The daily collection's own keys and records through whole runs: disk
 // usage, the kernel's ECC events, network data usage, the storage
 // structured log and the reporting channels.
+#include <future>
+#include <set>
+
 #include "../records.h"
 #include "../test_values.h"
 #include "sim/default_device.h"
@@ -185,8 +188,33 @@ std::string Right(size_t width, const std::string& text) {
   return std::string(width > text.size() ? width - text.size() : 0, ' ') + text;
 }
 
-TEST_F(CollectRun, DevsimShowsEveryChannelWithASample) {
-  RunResult r = RunProgram(DEVSIM_BIN, {"ioreport", root.path()}, env);
+TEST_F(CollectRun, DevsimShowsEveryChannelsChangeOverAnInterval) {
+  // Between the two samples the first driver's counters double, so the
+  // change equals what they held before.
+  const cf::Value before = ReadPlist(root / "device/ioreport.plist");
+  ASSERT_TRUE(before.AsDictionary());
+  cf::Dictionary after = before.AsDictionary()->MutableCopy();
+  cf::Dictionary pmgr_values;
+  for (const auto& [id, value] : *before.AsDictionary()->Get("4294970128").AsDictionary()) {
+    if (const cf::Number* n = value.AsNumber()) {
+      pmgr_values.Set(id, cf::Value::SInt64(2 * n->AsSInt64()));
+      continue;
+    }
+    cf::Array states;  // [state ID, transitions, residency]
+    for (const cf::Value& state : *value.AsArray()) {
+      const cf::Array& s = *state.AsArray();
+      states.Append(cf::Value(cf::Array({s[0], cf::Value::SInt64(2 * s[1].AsNumber()->AsSInt64()),
+                                         cf::Value::SInt64(2 * s[2].AsNumber()->AsSInt64())})));
+    }
+    pmgr_values.Set(id, states);
+  }
+  after.Set("4294970128", pmgr_values);
+  auto running = std::async(std::launch::async, [&] {
+    return RunProgram(DEVSIM_BIN, {"ioreport", root.path(), "--interval", "4"}, env);
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+  WritePlist("device/ioreport.plist", after);
+  RunResult r = running.get();
   ASSERT_EQ(r.status, 0) << r.err;
   EXPECT_EQ(r.err, "");
   const std::string pmgr = "pmgr <id 0x100000b10> ";
@@ -200,15 +228,26 @@ TEST_F(CollectRun, DevsimShowsEveryChannelWithASample) {
       Right(20, "PerformanceStates") + "[     LOW] = { # 310      1.800e+01 s / 20.8% }\n" + "  " +
       Right(20, "PerformanceStates") + "[    HIGH] = { # 275      7.200e+00 s /  8.3% }\n";
   EXPECT_EQ(r.out.substr(0, expected.size()), expected);
-  const std::string latency = "  " + Right(20, "ReadLatency") + "[" + Right(12, "0") + " - " + Right(12, "100") +
-                              " us] = { m " + Right(12, "20") + "; M " + Right(12, "95") + "; s " + Right(12, "7600") +
-                              "; # " + Right(12, "120") + " }\n";
-  EXPECT_NE(r.out.find(latency), std::string::npos) << r.out;
-  EXPECT_NE(r.out.find("  " + Right(20, "ReadLatency") + "[" + Right(12, "300") + " - " + Right(12, "400") +
+  // The second driver did not change.
+  EXPECT_NE(r.out.find("  " + Right(20, "ReadLatency") + "[" + Right(12, "0") + " - " + Right(12, "100") +
                        " us] = { <no hits>; # 0 }\n"),
-            std::string::npos);
+            std::string::npos) << r.out;
   EXPECT_NE(r.out.find("nvme-report <id 0x100000b20> QueueDepth < 0x2 ((null)) | G/g Storage/(none) | cat 0x02 |"),
             std::string::npos);
+
+  // The field category only, as JSON.
+  r = RunProgram(DEVSIM_BIN, {"ioreport", root.path(), "--interval", "0", "--category", "0x100", "--json"}, env);
+  ASSERT_EQ(r.status, 0) << r.err;
+  const cf::Value json = cf::ParseJSON(r.out).value;
+  ASSERT_TRUE(json.AsArray()) << r.out;
+  std::set<std::string> names;
+  for (const cf::Value& c : *json.AsArray()) {
+    names.insert(*c.AsDictionary()->Get("channel").AsString());
+    if (c.AsDictionary()->Get("format") == cf::Value("simple")) {
+      EXPECT_EQ(c.AsDictionary()->Get("delta"), cf::Value::SInt64(0));
+    }
+  }
+  EXPECT_EQ(names, (std::set<std::string>{"CPU0", "GPUEnergy", "PerformanceStates", "HostReadMiB", "ReadLatency"}));
 
   // A hub that cannot map its buffer.
   cf::Array registry = sim::DefaultStorageDevice().registry.AsArray()->MutableCopy();
