@@ -184,6 +184,41 @@ TEST_F(CollectRun, TheDefaultDevicesSimpleFieldChannelsBecomeKeys) {
   EXPECT_EQ(Scalar("com.velmora.ioreport.CPU0"), "0");  // no longer in the file
 }
 
+TEST_F(CollectRun, OnlyTheSimpleFieldChannelsOfAHubBecomeKeys) {
+  auto channel = [](int64_t id, uint64_t format, uint64_t elements, const char* name) {
+    return cf::Value(cf::Array({cf::Value::SInt64(id),
+                                cf::Value::SInt64(static_cast<int64_t>(format | (0x0100ull << 16) | (elements << 32))),
+                                cf::Value(name)}));
+  };
+  const sim::DefaultDevice device = sim::DefaultStorageDevice();
+  cf::Array registry({(*device.registry.AsArray())[0]});
+  registry.Append(Dict({{"class", "IOReportHub"}, {"id", cf::Value::UInt64(0x500)}, {"userClient", "hub"}}));
+  registry.Append(Dict(
+      {{"class", "Sensors"},
+       {"name", "sensors"},
+       {"id", cf::Value::UInt64(0x600)},
+       {"properties",
+        Dict({{"IOReportLegendPublic", cf::Value::Bool(true)},
+              {"IOReportLegend",
+               cf::Array({cf::Value(Dict({{"IOReportGroupName", "Sensors"},
+                                          {"IOReportChannels",
+                                           cf::Array({channel(1, 1, 1, "Alpha"), channel(2, 1, 1, "Beta"),
+                                                      channel(3, 3, 2, "Spread")})}}))})}})}}));
+  WritePlist("device/registry.plist", registry);
+  WritePlist("device/ioreport.plist",
+             Dict({{"1536", Dict({{"1", cf::Value::SInt64(11)},
+                                  {"2", cf::Value::SInt64(-22)},
+                                  {"3", cf::Array({cf::Value(cf::Array({cf::Value::SInt64(4), cf::Value::SInt64(1),
+                                                                        cf::Value::SInt64(9), cf::Value::SInt64(20)})),
+                                                   cf::Value(cf::Array({cf::Value::SInt64(2)}))})}})}}));
+  const RunResult r = Tallyrun({"-f"});
+  const RunResult dump =
+      RunProgram(TALLYBOOK_BIN, {"dump", "--day", std::to_string(kToday), "--prefix", "com.velmora.ioreport."}, env);
+  EXPECT_EQ(dump.out, std::to_string(kToday) + " com.velmora.ioreport.Alpha 11\n" + std::to_string(kToday) +
+                          " com.velmora.ioreport.Beta -22\n")
+      << r.err;
+}
+
 std::string Right(size_t width, const std::string& text) {
   return std::string(width > text.size() ? width - text.size() : 0, ' ') + text;
 }
