@@ -506,6 +506,17 @@ TEST(IOReportLegendTest, LegendsThatAreNotArrays) {
                               1, "D", nullptr),
             kIOReturnSuccess);
   EXPECT_EQ(IOReportGetChannelCount(aggregate), 1);
+  // A channel without a numeric ID and type fails the whole legend.
+  for (const cf::Value& bad : {cf::Value(cf::Array({cf::Value::SInt64(1)})),
+                               cf::Value(cf::Array({cf::Value("x"), cf::Value::SInt64(1)})),
+                               cf::Value(cf::Array({cf::Value::SInt64(1), cf::Value("simple")}))}) {
+    error.reset();
+    EXPECT_EQ(addLegendChannels(aggregate, cf::Array({Dict({{"IOReportChannels", cf::Array({bad})}})}), 1, "D",
+                                &error),
+              kIOReturnError);
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->Description(), "Mach error 0xe00002bc: couldn't create channel");
+  }
 }
 
 }  // namespace

@@ -84,7 +84,13 @@ IOReturn addLegendChannels(const cf::Value& aggregate, const cf::Value& legend, 
     const cf::Array* channels = entry->Get("IOReportChannels").AsArray();
     if (!channels) break;
     for (const cf::Value& legendChannel : *channels) {
-      if (!legendChannel.AsArray()) break;
+      const cf::Array* numbers = legendChannel.AsArray();
+      if (!numbers) break;
+      // A channel is made only from a numeric ID and type.
+      if (numbers->size() < 2 || !(*numbers)[0].AsNumber() || !(*numbers)[1].AsNumber()) {
+        setError(error, kIOReturnError, "couldn't create channel");
+        return kIOReturnError;
+      }
       const cf::Value channel = newChannel(driverID, driverName, legendChannel, group, subgroup, info);
       if (addChannel(aggregate, channel, options) != kIOReturnSuccess) {
         setError(error, kIOReturnError, "_addChannel() failed");
