@@ -96,6 +96,9 @@ class HubClient : public UserClient {
   }
 
   kern_return_t ConfigureInterests(MethodCall& call) {
+    // One interest list per connection: the buffer a client has mapped must
+    // not move under it.
+    if (configured_) return kIOReturnBadArgument;
     if (!call.struct_in || call.struct_in_size < 8 || !call.scalar_out || *call.scalar_out_count < 1)
       return kIOReturnBadArgument;
     const auto* in = static_cast<const uint8_t*>(call.struct_in);
