@@ -190,6 +190,11 @@ TEST_F(CollectRun, OnlyTheSimpleFieldChannelsOfAHubBecomeKeys) {
                                 cf::Value::SInt64(static_cast<int64_t>(format | (0x0100ull << 16) | (elements << 32))),
                                 cf::Value(name)}));
   };
+  // Besides the two simple channels and a histogram, state channels large
+  // enough that subscribing to them all would overflow the hub's buffer:
+  // they must be pruned before subscribing, or no key is written at all.
+  cf::Array channels({channel(1, 1, 1, "Alpha"), channel(2, 1, 1, "Beta"), channel(3, 3, 2, "Spread")});
+  for (int i = 0; i < 17; ++i) channels.Append(channel(100 + i, 2, 65535, "Huge"));
   const sim::DefaultDevice device = sim::DefaultStorageDevice();
   cf::Array registry({(*device.registry.AsArray())[0]});
   registry.Append(Dict({{"class", "IOReportHub"}, {"id", cf::Value::UInt64(0x500)}, {"userClient", "hub"}}));
@@ -202,8 +207,7 @@ TEST_F(CollectRun, OnlyTheSimpleFieldChannelsOfAHubBecomeKeys) {
               {"IOReportLegend",
                cf::Array({cf::Value(Dict({{"IOReportGroupName", "Sensors"},
                                           {"IOReportChannels",
-                                           cf::Array({channel(1, 1, 1, "Alpha"), channel(2, 1, 1, "Beta"),
-                                                      channel(3, 3, 2, "Spread")})}}))})}})}}));
+                                           channels}}))})}})}}));
   WritePlist("device/registry.plist", registry);
   WritePlist("device/ioreport.plist",
              Dict({{"1536", Dict({{"1", cf::Value::SInt64(11)},
