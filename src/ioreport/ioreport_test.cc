@@ -226,8 +226,11 @@ TEST(IOReportAggregateTest, PruningRemovesEmptiedLevels) {
   EXPECT_EQ(IOReportPrune(again, [&](const cf::Dictionary& c) { return IOReportChannelGetChannelID(c) == 3 ? 1 : 16; }),
             1);
   EXPECT_EQ(Names(again), (std::vector<std::string>{"b1", "c1"}));  // A was pruned before the failure
-  // Codes other than skip and failure are ORed into the result.
+  // Codes other than skip and failure are ORed into the result; only a
+  // plain skip removes a channel.
   EXPECT_EQ(IOReportIterate(again, [](const cf::Dictionary&) { return 2; }), 2);
+  EXPECT_EQ(IOReportPrune(again, [](const cf::Dictionary&) { return 0x30; }), 0x30);
+  EXPECT_EQ(Names(again), (std::vector<std::string>{"b1", "c1"}));
 }
 
 TEST(IOReportAggregateTest, MalformedAggregates) {

@@ -232,6 +232,9 @@ TEST_F(IOReportSamplesTest, HistogramBucketsAndBounds) {
       {Segments({{10, 0, 0, 5}}), {}},               // more bounds than elements
       {Segments({{0, 0, 0, 1}}), {}},                // the first bound must be above 0
       {Segments({{1, 1, 0, 2}}), {}},                // 1, 1 does not rise
+      // Exact to the last unit, just below 2^63; one step more cannot be stored.
+      {Segments({{2097151, 1, 0, 3}}), {2097151, 4398042316801, 9223358842721533951}},
+      {Segments({{2097152, 1, 0, 3}}), {}},
       {Raw(std::string(15, '\0')), {}},
       {cf::Value(), {}},
   };

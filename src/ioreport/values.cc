@@ -157,9 +157,9 @@ int IOReportStateGetCurrent(const cf::Dictionary& sample) {
   const auto elements = checkedElements(sample, kIOReportFormatState);
   if (!elements) return -1;
   int current = -1;
-  int64_t latest = 0;
+  uint64_t latest = 0;  // update times are unsigned
   for (size_t i = 0; i < elements->count; ++i) {
-    const int64_t time = static_cast<int64_t>(elements->At(i, kTimeOffset));
+    const uint64_t time = elements->At(i, kTimeOffset);
     if (time > latest) {
       latest = time;
       current = static_cast<int>(i);
@@ -216,12 +216,14 @@ IOReturn IOReportHistogramGetBucketBounds(const cf::Dictionary& channel, int ind
       std::memcpy(&exponential, config->data() + at + 4, 4);
       std::memcpy(&buckets, config->data() + at + 12, 4);
       // Bounds restart in every segment; each must still rise above the last.
-      double bound = 1;
+      // Exact integers; a bound beyond 64 signed bits cannot be stored.
+      int64_t bound = 1;
       for (int32_t j = 0; j < buckets; ++j) {
-        bound = exponential ? bound * width : static_cast<double>(width) * (j + 1);
-        if (!(bound > static_cast<double>(previous)) || bound >= 9.2e18) return kIOReturnError;
+        const bool overflow = exponential ? __builtin_mul_overflow(bound, int64_t{width}, &bound)
+                                          : __builtin_mul_overflow(int64_t{width}, int64_t{j} + 1, &bound);
+        if (overflow || bound <= previous) return kIOReturnError;
         if (computed.size() >= static_cast<size_t>(capacity)) return kIOReturnError;
-        previous = static_cast<int64_t>(bound);
+        previous = bound;
         computed.Append(cf::Value::SInt64(previous));
       }
     }

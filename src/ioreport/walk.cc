@@ -53,7 +53,7 @@ int walkLevel(cf::Dictionary level, const Walk& walk, cf::Dictionary* copy, int 
       } else {
         r = (*walk.visit)(channel);
         if (r & kIOReportIterFailed) return r;
-        if (walk.mode == Mode::kPrune && (r & kIOReportIterSkipped)) {
+        if (walk.mode == Mode::kPrune && r == kIOReportIterSkipped) {
           channels.RemoveAt(i);
           result |= r;
           continue;
