@@ -189,7 +189,9 @@ TEST(IOReportAggregateTest, ChannelsAreFiledByDriverAndGroup) {
   EXPECT_EQ(IOReportAddChannelDescription(grouped, 7, "D", 1, 0, {}, "G", {}, {}, &error), kIOReturnError);
   EXPECT_EQ(error->code, kIOReturnError);
   EXPECT_EQ(grouped.Description(), before);
-  EXPECT_EQ(IOReportAddChannelDescription(cf::Value("x"), 7, "D", 1, 0, {}, {}, {}, {}, nullptr), kIOReturnBadArgument);
+  error.reset();
+  EXPECT_EQ(IOReportAddChannelDescription(cf::Value("x"), 7, "D", 1, 0, {}, {}, {}, {}, &error), kIOReturnBadArgument);
+  EXPECT_EQ(error->Description(), "Mach error 0xe00002c2: _addChannel() failed");
 }
 
 cf::Value ThreeDrivers() {

@@ -222,7 +222,8 @@ IOReturn IOReportAddChannelDescription(const cf::Value& aggregate, uint64_t driv
                                        IOReportErrorOut error) {
   const cf::Dictionary* top = aggregate.AsDictionary();
   if (!top) {
-    setError(error, kIOReturnBadArgument, "bad argument");
+    // The add itself refuses what is not an aggregate.
+    setError(error, kIOReturnBadArgument, "_addChannel() failed");
     return kIOReturnBadArgument;
   }
   cf::Array legend({cf::Value::SInt64(channelID), cf::Value::SInt64(channelType)});
