@@ -149,6 +149,27 @@ TEST_F(IOReportSamplesTest, RecordsWithoutElementsOrOverrunningTheBuffer) {
   EXPECT_EQ(IOReportGetChannelCount(IOReportCreateSamplesRaw(channels, Raw(raw), nullptr)), 0);
 }
 
+TEST_F(IOReportSamplesTest, LogLinesReadTheChannelBeforeItsNameIsCached) {
+  // Four entries fill the channel dictionary's storage, so caching the name
+  // moves its values: the log lines must not hold on to one across that.
+  const cf::Value channels =
+      Aggregate({{1, Type(1, 0x100, 1), "One"}, {2, Type(2, 0x100, 3), "Two"}}, IOReportCreateUnitInfo(0));
+  IOReportIterate(channels, [](const cf::Dictionary& c) {
+    EXPECT_EQ(c.size(), 4u);
+    return 0;
+  });
+  std::string raw = Element(0x10, 7, Type(1, 0, 0), 0, {});
+  EXPECT_EQ(IOReportGetChannelCount(IOReportCreateSamplesRaw(channels, Raw(raw), nullptr)), 0);
+  EXPECT_EQ(log->Count("channel has zero elements! PMGR <id 0x10> -- (null) -- (null) -- One"), 1u);
+  EXPECT_EQ(log->Count("channel has zero elements! PMGR <id 0x10> -- (null) -- (null) -- Two"), 1u);
+
+  const cf::Value fresh =
+      Aggregate({{1, Type(1, 0x100, 1), "One"}, {2, Type(2, 0x100, 3), "Two"}}, IOReportCreateUnitInfo(0));
+  raw = Element(0x10, 2, Type(2, 0x100, 3), 0, {}) + Element(0x10, 2, Type(2, 0x100, 3), 0, {});
+  EXPECT_TRUE(IOReportCreateSamplesRaw(fresh, Raw(raw), nullptr).IsNull());
+  EXPECT_EQ(log->Count("absurd element count! nelems=3, PMGR <id 0x10> -- (null) -- (null) -- Two"), 1u);
+}
+
 TEST_F(IOReportSamplesTest, EachChannelTakesItsFirstRecordWhereverItLies) {
   // Many channels, their records in the reverse of walk order, some IDs
   // shared with another driver, and a second record for channel 7.

@@ -52,10 +52,21 @@ std::vector<uint8_t> createInterestList(const cf::Value& channels, int n) {
   return list;
 }
 
+// What a log line says of a channel: driver, group, subgroup and name. The
+// name comes first and everything is copied: asking for the name caches it in
+// the channel dictionary, which may move the values a reference would hold.
+struct LoggedChannel {
+  explicit LoggedChannel(const cf::Dictionary& channel)
+      : name(IOReportChannelGetChannelName(channel)),
+        driver(channel.Get("DriverName")),
+        group(IOReportChannelGetGroup(channel)),
+        subgroup(IOReportChannelGetSubGroup(channel)) {}
+  cf::Value name, driver, group, subgroup;
+};
+
 void logZeroElements(const cf::Dictionary& channel) {
-  platform::LogError("channel has zero elements! %@ -- %@ -- %@ -- %@", channel.Get("DriverName"),
-                     IOReportChannelGetGroup(channel), IOReportChannelGetSubGroup(channel),
-                     cf::Value(IOReportChannelGetChannelName(channel)));
+  const LoggedChannel c(channel);
+  platform::LogError("channel has zero elements! %@ -- %@ -- %@ -- %@", c.driver, c.group, c.subgroup, c.name);
 }
 
 }  // namespace
@@ -250,9 +261,9 @@ cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw
           }
         }
         if (length > usable - *at) {
-          platform::LogFault("absurd element count! nelems=%d, %@ -- %@ -- %@ -- %@", static_cast<int>(count),
-                             channel.Get("DriverName"), IOReportChannelGetGroup(channel),
-                             IOReportChannelGetSubGroup(channel), cf::Value(IOReportChannelGetChannelName(channel)));
+          const LoggedChannel c(channel);
+          platform::LogFault("absurd element count! nelems=%d, %@ -- %@ -- %@ -- %@", static_cast<int>(count), c.driver,
+                             c.group, c.subgroup, c.name);
           setErrorIfEmpty(error, kIOReturnError, "absurd element count");
           return kIOReportIterFailed;
         }
