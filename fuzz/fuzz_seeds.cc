@@ -268,5 +268,22 @@ int main(int argc, char** argv) {
   Seed("ioreport_legend", "overrun", input('\2', legend, element(0x10, 1, 1 | (9ull << 32), {1})));
   Seed("ioreport_legend", "zero-elements", input('\0', legend, element(0x10, 7, 1, {1}) + hub));
   Seed("ioreport_legend", "not-a-legend", input('\0', xml(info), hub));
+
+  // Raw samples against the fixed aggregate of fuzz_ioreport_raw: simple 1,
+  // state 2 (three elements), histogram 3 (three), array 4 (two), unknown 5,
+  // state 6 (legend says two), simple 7; all of driver 0x10.
+  auto type = [](uint8_t format, uint16_t elements) { return format | (0x100ull << 16) | (uint64_t{elements} << 32); };
+  std::string raw = element(0x10, 1, type(1, 1), {250});
+  for (int i = 0; i < 3; ++i) raw += element(0x10, 2, type(2, 3), {0x4F4E + i, i, 10 * i});
+  for (int i = 0; i < 3; ++i) raw += element(0x10, 3, type(3, 3), {i, 5, 9, 5 * i});
+  raw += element(0x10, 4, type(4, 2), {1, 2, 3, 4}) + element(0x10, 4, type(4, 2), {5, 6, 7, 8});
+  raw += element(0x10, 5, type(1, 1), {9});
+  for (int i = 0; i < 3; ++i) raw += element(0x10, 6, type(2, 3), {0x4F46 + i, 1, 1});
+  raw += element(0x10, 7, type(1, 1), {-1});
+  Seed("ioreport_raw", "valid", raw);
+  Seed("ioreport_raw", "100-bytes", raw.substr(0, 100));
+  Seed("ioreport_raw", "count-overflows", element(0x10, 1, type(1, 1), {1}) + element(0x10, 2, type(2, 0xFFFF), {1}) +
+                                              raw.substr(64, 3 * 64));
+  Seed("ioreport_raw", "cut-mid-record", raw.substr(0, 64 * 5 + 24));
   return 0;
 }

@@ -149,6 +149,50 @@ TEST_F(IOReportSamplesTest, RecordsWithoutElementsOrOverrunningTheBuffer) {
   EXPECT_EQ(IOReportGetChannelCount(IOReportCreateSamplesRaw(channels, Raw(raw), nullptr)), 0);
 }
 
+TEST_F(IOReportSamplesTest, LogLinesReadTheChannelBeforeItsNameIsCached) {
+  // Four entries fill the channel dictionary's storage, so caching the name
+  // moves its values: the log lines must not hold on to one across that.
+  const cf::Value channels =
+      Aggregate({{1, Type(1, 0x100, 1), "One"}, {2, Type(2, 0x100, 3), "Two"}}, IOReportCreateUnitInfo(0));
+  IOReportIterate(channels, [](const cf::Dictionary& c) {
+    EXPECT_EQ(c.size(), 4u);
+    return 0;
+  });
+  std::string raw = Element(0x10, 7, Type(1, 0, 0), 0, {});
+  EXPECT_EQ(IOReportGetChannelCount(IOReportCreateSamplesRaw(channels, Raw(raw), nullptr)), 0);
+  EXPECT_EQ(log->Count("channel has zero elements! PMGR <id 0x10> -- (null) -- (null) -- One"), 1u);
+  EXPECT_EQ(log->Count("channel has zero elements! PMGR <id 0x10> -- (null) -- (null) -- Two"), 1u);
+
+  const cf::Value fresh =
+      Aggregate({{1, Type(1, 0x100, 1), "One"}, {2, Type(2, 0x100, 3), "Two"}}, IOReportCreateUnitInfo(0));
+  raw = Element(0x10, 2, Type(2, 0x100, 3), 0, {}) + Element(0x10, 2, Type(2, 0x100, 3), 0, {});
+  EXPECT_TRUE(IOReportCreateSamplesRaw(fresh, Raw(raw), nullptr).IsNull());
+  EXPECT_EQ(log->Count("absurd element count! nelems=3, PMGR <id 0x10> -- (null) -- (null) -- Two"), 1u);
+}
+
+TEST_F(IOReportSamplesTest, EachChannelTakesItsFirstRecordWhereverItLies) {
+  // Many channels, their records in the reverse of walk order, some IDs
+  // shared with another driver, and a second record for channel 7.
+  cf::Value channels = IOReportCreateAggregate(0);
+  for (int64_t id = 1; id <= 300; ++id)
+    IOReportAddChannelDescription(channels, 0x10, "A", id, static_cast<int64_t>(Type(1, 0x100, 1)), {}, {}, {}, {},
+                                  nullptr);
+  std::string raw;
+  for (int64_t id = 300; id >= 1; --id) {
+    raw += Element(0x10, static_cast<uint64_t>(id), Type(1, 0x100, 1), 0, {id * 10});
+    if (id % 3 == 0) raw += Element(0x11, static_cast<uint64_t>(id), Type(1, 0x100, 1), 0, {-id});
+  }
+  raw += Element(0x10, 7, Type(1, 0x100, 1), 0, {-7});
+  const cf::Value samples = IOReportCreateSamplesRaw(channels, Raw(raw), nullptr);
+  int seen = 0;
+  IOReportIterate(samples, [&](const cf::Dictionary& s) {
+    EXPECT_EQ(IOReportSimpleGetIntegerValue(s, nullptr), IOReportChannelGetChannelID(s) * 10);
+    ++seen;
+    return 0;
+  });
+  EXPECT_EQ(seen, 300);
+}
+
 cf::Dictionary StateSample(std::initializer_list<std::array<int64_t, 4>> states, uint16_t legend_count = 0) {
   const uint16_t n = legend_count ? legend_count : static_cast<uint16_t>(states.size());
   std::string raw;

@@ -1,5 +1,6 @@
 // Subscribing through the reporting hub and cutting its buffer into samples.
 #include <cstring>
+#include <optional>
 #include <vector>
 
 #include "ioreport/internal.h"
@@ -51,10 +52,21 @@ std::vector<uint8_t> createInterestList(const cf::Value& channels, int n) {
   return list;
 }
 
+// What a log line says of a channel: driver, group, subgroup and name. The
+// name comes first and everything is copied: asking for the name caches it in
+// the channel dictionary, which may move the values a reference would hold.
+struct LoggedChannel {
+  explicit LoggedChannel(const cf::Dictionary& channel)
+      : name(IOReportChannelGetChannelName(channel)),
+        driver(channel.Get("DriverName")),
+        group(IOReportChannelGetGroup(channel)),
+        subgroup(IOReportChannelGetSubGroup(channel)) {}
+  cf::Value name, driver, group, subgroup;
+};
+
 void logZeroElements(const cf::Dictionary& channel) {
-  platform::LogError("channel has zero elements! %@ -- %@ -- %@ -- %@", channel.Get("DriverName"),
-                     IOReportChannelGetGroup(channel), IOReportChannelGetSubGroup(channel),
-                     cf::Value(IOReportChannelGetChannelName(channel)));
+  const LoggedChannel c(channel);
+  platform::LogError("channel has zero elements! %@ -- %@ -- %@ -- %@", c.driver, c.group, c.subgroup, c.name);
 }
 
 }  // namespace
@@ -152,6 +164,70 @@ cf::Value IOReportCreateSamplesRaw(const cf::Value& channels, const cf::Value& r
                                 error);
 }
 
+namespace {
+
+// Where each channel's record begins: the first record of each (driver ID,
+// channel ID) pair, found in one pass along the chain of records. The chain
+// ends at the buffer's end, at a record that runs past it (which is kept:
+// its channel fails) or at a record claiming no elements (which is not:
+// every channel not found before it is logged as having none).
+class RecordIndex {
+ public:
+  RecordIndex(const uint8_t* base, size_t usable) : base_(base) {
+    std::vector<size_t> starts;
+    for (size_t at = 0; at + kIOReportElementSize <= usable;) {
+      const size_t count = (readU64(base + at + 16) >> 32) & 0xFFFF;
+      if (count == 0) {
+        ends_without_elements_ = true;
+        break;
+      }
+      starts.push_back(at);
+      at += count * kIOReportElementSize;
+    }
+    // Open addressing at most half full; slots hold offset + 1, 0 is empty.
+    size_t capacity = 16;
+    while (capacity < 2 * starts.size()) capacity *= 2;
+    slots_.assign(capacity, 0);
+    for (const size_t at : starts) {
+      const uint64_t driver = readU64(base + at), id = readU64(base + at + 8);
+      for (size_t s = slotOf(driver, id);; s = (s + 1) & (capacity - 1)) {
+        if (slots_[s] == 0) {
+          slots_[s] = at + 1;
+          break;
+        }
+        if (matches(slots_[s] - 1, driver, id)) break;  // the first record of a channel wins
+      }
+    }
+  }
+
+  // The offset of the channel's record, if the chain holds one.
+  std::optional<size_t> Find(uint64_t driver, uint64_t id) const {
+    for (size_t s = slotOf(driver, id);; s = (s + 1) & (slots_.size() - 1)) {
+      if (slots_[s] == 0) return std::nullopt;
+      if (matches(slots_[s] - 1, driver, id)) return slots_[s] - 1;
+    }
+  }
+  bool endsWithoutElements() const { return ends_without_elements_; }
+
+ private:
+  size_t slotOf(uint64_t driver, uint64_t id) const {
+    uint64_t h = (driver * 0x9E3779B97F4A7C15ull) ^ id;
+    h ^= h >> 29;
+    h *= 0xBF58476D1CE4E5B9ull;
+    h ^= h >> 32;
+    return static_cast<size_t>(h) & (slots_.size() - 1);
+  }
+  bool matches(size_t at, uint64_t driver, uint64_t id) const {
+    return readU64(base_ + at) == driver && readU64(base_ + at + 8) == id;
+  }
+
+  const uint8_t* base_;
+  std::vector<size_t> slots_;
+  bool ends_without_elements_ = false;
+};
+
+}  // namespace
+
 cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw, IOReportErrorOut error) {
   if (raw.size() < kIOReportElementSize) {
     setError(error, kIOReturnBadArgument, "couldn't create samples");
@@ -160,44 +236,39 @@ cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw
   const auto* base = reinterpret_cast<const uint8_t*>(raw.data());
   // Trailing bytes short of a whole element are not read.
   const size_t usable = raw.size() / kIOReportElementSize * kIOReportElementSize;
+  const RecordIndex index(base, usable);
   int r = 0;
   cf::Value samples = copyChannels(
       channels,
       [&](const cf::Dictionary& channel, cf::Dictionary& copy) {
         const uint64_t driver = static_cast<uint64_t>(IOReportChannelGetDriverID(channel));
         const uint64_t id = static_cast<uint64_t>(IOReportChannelGetChannelID(channel));
-        for (size_t at = 0; at + kIOReportElementSize <= usable;) {
-          const uint8_t* record = base + at;
-          const uint64_t type = readU64(record + 16);
-          const size_t count = (type >> 32) & 0xFFFF;
-          if (count == 0) {
-            logZeroElements(channel);
-            return kIOReportIterSkipped;
-          }
-          const size_t length = count * kIOReportElementSize;
-          if (readU64(record) != driver || readU64(record + 8) != id) {
-            at += length;
-            continue;
-          }
-          if (IOReportChannelGetFormat(channel) == kIOReportFormatUnknown) {
-            // Channels asked for by ID learn their type from the first sample.
-            if (const cf::Array* legend = channel.Get("LegendChannel").AsArray()) {
-              cf::Array learned = legend->MutableCopy();
-              if (learned.size() >= 2) learned.Set(1, cf::Value::SInt64(static_cast<int64_t>(type)));
-              copy.Set("LegendChannel", learned);
-            }
-          }
-          if (length > usable - at) {
-            platform::LogFault("absurd element count! nelems=%d, %@ -- %@ -- %@ -- %@", static_cast<int>(count),
-                               channel.Get("DriverName"), IOReportChannelGetGroup(channel),
-                               IOReportChannelGetSubGroup(channel), cf::Value(IOReportChannelGetChannelName(channel)));
-            setErrorIfEmpty(error, kIOReturnError, "absurd element count");
-            return kIOReportIterFailed;
-          }
-          copy.Set("RawElements", cf::Value::Bytes(cf::Data(record, record + length)));
-          return kIOReportIterOk;
+        const std::optional<size_t> at = index.Find(driver, id);
+        if (!at) {
+          if (index.endsWithoutElements()) logZeroElements(channel);
+          return kIOReportIterSkipped;
         }
-        return kIOReportIterSkipped;
+        const uint8_t* record = base + *at;
+        const uint64_t type = readU64(record + 16);
+        const size_t count = (type >> 32) & 0xFFFF;
+        const size_t length = count * kIOReportElementSize;
+        if (IOReportChannelGetFormat(channel) == kIOReportFormatUnknown) {
+          // Channels asked for by ID learn their type from the first sample.
+          if (const cf::Array* legend = channel.Get("LegendChannel").AsArray()) {
+            cf::Array learned = legend->MutableCopy();
+            if (learned.size() >= 2) learned.Set(1, cf::Value::SInt64(static_cast<int64_t>(type)));
+            copy.Set("LegendChannel", learned);
+          }
+        }
+        if (length > usable - *at) {
+          const LoggedChannel c(channel);
+          platform::LogFault("absurd element count! nelems=%d, %@ -- %@ -- %@ -- %@", static_cast<int>(count), c.driver,
+                             c.group, c.subgroup, c.name);
+          setErrorIfEmpty(error, kIOReturnError, "absurd element count");
+          return kIOReportIterFailed;
+        }
+        copy.Set("RawElements", cf::Value::Bytes(cf::Data(record, record + length)));
+        return kIOReportIterOk;
       },
       &r);
   if (samples.IsNull()) setErrorIfEmpty(error, kIOReturnBadArgument, "couldn't create samples");
