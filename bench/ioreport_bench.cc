@@ -5,20 +5,13 @@
 // that reads the same buffer and sums each record's values. Ends with a
 // summary: each benchmark's time as a multiple of the floor, and its heap
 // allocations per channel.
-// The counting operator new below replaces the global one; GCC cannot see
-// that its pointers go back to free() through the matching delete.
-#pragma GCC diagnostic ignored "-Wmismatched-new-delete"
-
 #include <benchmark/benchmark.h>
-#include <malloc.h>
 
-#include <atomic>
 #include <cstdio>
-#include <cstdlib>
 #include <cstring>
-#include <map>
-#include <new>
 #include <string>
+
+#include "bench/ratio.h"
 
 #include "ioreport/ioreport.h"
 #include "ioreport/samples.h"
@@ -30,8 +23,6 @@ constexpr int kChannelsPerDriver = 250;
 constexpr double kChannels = kDrivers * kChannelsPerDriver;
 // The most cutting and walking may take, in floors.
 constexpr double kSamplesLimit = 30;
-
-std::atomic<uint64_t> g_allocations{0};
 
 uint64_t Type(uint8_t format, uint16_t elements) {
   return format | (uint64_t{kIOReportCategoryField} << 16) | (uint64_t{elements} << 32);
@@ -163,8 +154,7 @@ uint64_t WalkSamples(const cf::Value& samples, size_t* visited) {
 }
 
 void PerChannelAllocations(benchmark::State& state, uint64_t before) {
-  state.counters["allocs/channel"] =
-      static_cast<double>(g_allocations.load() - before) / (static_cast<double>(state.iterations()) * kChannels);
+  bench::CountAllocations(state, before, kChannels, "allocs/channel");
 }
 
 void BM_SamplesFloor(benchmark::State& state) {
@@ -176,7 +166,7 @@ BENCHMARK(BM_SamplesFloor);
 void BM_CreateSamplesAndIterate(benchmark::State& state) {
   const Fixture& f = Data();
   size_t visited = 0;
-  const uint64_t before = g_allocations.load();
+  const uint64_t before = bench::g_allocations.load();
   for (auto _ : state) {
     visited = 0;
     const cf::Value samples = IOReportCreateSamplesRaw(f.channels, f.raw, nullptr);
@@ -190,7 +180,7 @@ BENCHMARK(BM_CreateSamplesAndIterate)->Unit(benchmark::kMicrosecond);
 // The two halves of the above on their own.
 void BM_CreateSamples(benchmark::State& state) {
   const Fixture& f = Data();
-  const uint64_t before = g_allocations.load();
+  const uint64_t before = bench::g_allocations.load();
   for (auto _ : state) benchmark::DoNotOptimize(IOReportCreateSamplesRaw(f.channels, f.raw, nullptr));
   PerChannelAllocations(state, before);
 }
@@ -200,7 +190,7 @@ void BM_IterateSamples(benchmark::State& state) {
   const Fixture& f = Data();
   const cf::Value samples = IOReportCreateSamplesRaw(f.channels, f.raw, nullptr);
   size_t visited = 0;
-  const uint64_t before = g_allocations.load();
+  const uint64_t before = bench::g_allocations.load();
   for (auto _ : state) {
     visited = 0;
     benchmark::DoNotOptimize(WalkSamples(samples, &visited));
@@ -209,57 +199,14 @@ void BM_IterateSamples(benchmark::State& state) {
 }
 BENCHMARK(BM_IterateSamples)->Unit(benchmark::kMicrosecond);
 
-// Keeps each run's time per iteration and allocations per channel.
-class SummaryReporter : public benchmark::ConsoleReporter {
- public:
-  struct Result {
-    double time = 0;
-    double allocations = -1;
-  };
-  void ReportRuns(const std::vector<Run>& runs) override {
-    for (const Run& r : runs) {
-      Result& result = results[r.benchmark_name()];
-      // Adjusted times are in each benchmark's own unit; keep nanoseconds.
-      result.time = r.GetAdjustedRealTime() / benchmark::GetTimeUnitMultiplier(r.time_unit);
-      if (auto it = r.counters.find("allocs/channel"); it != r.counters.end()) result.allocations = it->second;
-    }
-    ConsoleReporter::ReportRuns(runs);
-  }
-  std::map<std::string, Result> results;
-};
-
 }  // namespace
 
-void* operator new(size_t n) {
-  g_allocations.fetch_add(1, std::memory_order_relaxed);
-  if (void* p = std::malloc(n ? n : 1)) return p;
-  throw std::bad_alloc();
-}
-void operator delete(void* p) noexcept { std::free(p); }
-void operator delete(void* p, size_t) noexcept { std::free(p); }
-
 int main(int argc, char** argv) {
-  // Keep freed memory with the process between iterations, so that no
-  // iteration pays page faults for the heap the last one gave back.
-  mallopt(M_TRIM_THRESHOLD, 256 << 20);
-  mallopt(M_MMAP_THRESHOLD, 256 << 20);
-  benchmark::Initialize(&argc, argv);
   const Fixture& f = Data();
   std::printf("%d channels, %zu records, %zu elements, %zu bytes\n", IOReportGetChannelCount(f.channels), f.records,
               f.elements, f.raw.AsData()->size());
-  SummaryReporter reporter;
-  benchmark::RunSpecifiedBenchmarks(&reporter);
-  std::printf("\n%-28s %12s %18s\n", "summary", "x the floor", "allocations/channel");
-  auto line = [&](const char* name, double limit) {
-    const auto it = reporter.results.find(name), base = reporter.results.find("BM_SamplesFloor");
-    if (it == reporter.results.end() || base == reporter.results.end() || base->second.time <= 0) return;
-    const double ratio = it->second.time / base->second.time;
-    std::printf("%-28s %12.1f %18.2f", name, ratio, it->second.allocations);
-    if (limit > 0) std::printf("   (limit %.0fx: %s)", limit, ratio <= limit ? "within" : "OVER");
-    std::printf("\n");
-  };
-  line("BM_CreateSamplesAndIterate", kSamplesLimit);
-  line("BM_CreateSamples", 0);
-  line("BM_IterateSamples", 0);
-  return 0;
+  return bench::RunWithSummary(argc, argv, "allocs/channel",
+                               {{"BM_CreateSamplesAndIterate", "BM_SamplesFloor", kSamplesLimit},
+                                {"BM_CreateSamples", "BM_SamplesFloor", 0},
+                                {"BM_IterateSamples", "BM_SamplesFloor", 0}});
 }

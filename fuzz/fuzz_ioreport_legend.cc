@@ -7,38 +7,7 @@
 #include "cf/plist.h"
 #include "ioreport/ioreport.h"
 #include "ioreport/samples.h"
-
-namespace {
-
-void AskChannel(const cf::Dictionary& c) {
-  (void)IOReportChannelGetFormat(c);
-  (void)IOReportChannelGetCategories(c);
-  (void)IOReportChannelGetChannelName(c);
-  (void)IOReportChannelGetUnitLabel(c);
-  (void)IOReportChannelCopyDescription(c, {}, "> ");
-  (void)IOReportStateGetCount(c);
-  int64_t lower, upper;
-  for (int i = -1; i < 3; ++i) (void)IOReportHistogramGetBucketBounds(c, i, &lower, &upper);
-}
-
-void AskSample(const cf::Dictionary& s) {
-  (void)IOReportSimpleGetIntegerValue(s, nullptr);
-  for (int i = -1; i < 6; ++i) {
-    (void)IOReportArrayGetValueAtIndex(s, i);
-    (void)IOReportStateGetResidency(s, i);
-    (void)IOReportStateGetNameForIndex(s, i);
-    (void)IOReportStateGetDutyCycle(s, i);
-    (void)IOReportHistogramGetBucketSum(s, i);
-  }
-  (void)IOReportStateGetIndexForID(s, 0);
-  (void)IOReportStateGetCurrent(s);
-  (void)IOReportHistogramGetMinValue(s);
-  (void)IOReportHistogramGetMaxValue(s);
-  (void)IOReportSampleCreateDelta(s, s, nullptr);
-  (void)IOReportSampleCopyDescription(s, {}, "  ");
-}
-
-}  // namespace
+#include "ioreport_ask.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (size < 3) return 0;
@@ -51,12 +20,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   std::optional<IOReportError> error;
   (void)addLegendChannels(aggregate, parsed.value, 0x10, "D <id 0x10>", &error);
   IOReportIterate(aggregate, [](const cf::Dictionary& c) {
-    AskChannel(c);
+    fuzz::AskChannel(c);
     return 0;
   });
   const cf::Value samples = createSamplesFromBytes(aggregate, bytes.substr(legend_size), &error);
   IOReportIterate(samples, [](const cf::Dictionary& s) {
-    AskSample(s);
+    fuzz::AskSample(s);
     return 0;
   });
   (void)IOReportCreateSamplesDelta(samples, samples, nullptr);

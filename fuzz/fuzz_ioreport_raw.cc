@@ -14,6 +14,7 @@
 
 #include "ioreport/ioreport.h"
 #include "ioreport/samples.h"
+#include "ioreport_ask.h"
 
 namespace {
 
@@ -46,40 +47,6 @@ const cf::Value& Channels() {
   return aggregate;
 }
 
-void AskSample(const cf::Dictionary& s) {
-  int64_t unit = 0;
-  (void)IOReportChannelGetFormat(s);
-  (void)IOReportChannelGetCategories(s);
-  (void)IOReportChannelGetChannelID(s);
-  (void)IOReportChannelGetDriverID(s);
-  (void)IOReportChannelGetChannelName(s);
-  (void)IOReportChannelGetUnitLabel(s);
-  (void)IOReportChannelCopyDescription(s, {}, "> ");
-  (void)IOReportSimpleGetIntegerValue(s, &unit);
-  (void)IOReportStateGetCount(s);
-  (void)IOReportHistogramGetBucketCount(s);
-  for (int i = -1; i < 9; ++i) {
-    int64_t lower, upper;
-    (void)IOReportArrayGetValueAtIndex(s, i);
-    (void)IOReportStateGetIDForIndex(s, i);
-    (void)IOReportStateGetInTransitions(s, i);
-    (void)IOReportStateGetResidency(s, i);
-    (void)IOReportStateGetNameForIndex(s, i);
-    (void)IOReportStateGetDutyCycle(s, i);
-    (void)IOReportHistogramGetBucketHits(s, i);
-    (void)IOReportHistogramGetBucketMinValue(s, i);
-    (void)IOReportHistogramGetBucketMaxValue(s, i);
-    (void)IOReportHistogramGetBucketSum(s, i);
-    (void)IOReportHistogramGetBucketBounds(s, i, &lower, &upper);
-  }
-  (void)IOReportStateGetIndexForID(s, 0);
-  (void)IOReportStateGetIndexForID(s, 0x4F4E);
-  (void)IOReportStateGetCurrent(s);
-  (void)IOReportHistogramGetMinValue(s);
-  (void)IOReportHistogramGetMaxValue(s);
-  (void)IOReportSampleCreateDelta(s, s, nullptr);
-  (void)IOReportSampleCopyDescription(s, {}, "  ");
-}
 
 }  // namespace
 
@@ -89,12 +56,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const cf::Value samples = IOReportCreateSamplesRaw(Channels(), raw, &error);
   if (error) (void)error->Description();
   IOReportIterate(samples, [](const cf::Dictionary& s) {
-    AskSample(s);
+    fuzz::AskSample(s);
     return 0;
   });
   const cf::Value delta = IOReportCreateSamplesDelta(samples, samples, nullptr);
   IOReportIterate(delta, [](const cf::Dictionary& s) {
-    AskSample(s);
+    fuzz::AskSample(s);
     return 0;
   });
   return 0;
