@@ -25,7 +25,7 @@ constexpr double kChannels = kDrivers * kChannelsPerDriver;
 constexpr double kSamplesLimit = 30;
 
 uint64_t Type(uint8_t format, uint16_t elements) {
-  return format | (uint64_t{kIOReportCategoryField} << 16) | (uint64_t{elements} << 32);
+  return static_cast<uint64_t>(IOReportChannelType(format, kIOReportCategoryField, elements));
 }
 
 // The channel's type by its place: simple, array, state and histogram in

@@ -19,7 +19,7 @@
 namespace {
 
 uint64_t Type(uint8_t format, uint16_t categories, uint16_t elements) {
-  return format | (uint64_t{categories} << 16) | (uint64_t{elements} << 32);
+  return static_cast<uint64_t>(IOReportChannelType(format, categories, elements));
 }
 
 const cf::Value& Channels() {

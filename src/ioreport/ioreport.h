@@ -40,6 +40,12 @@ inline constexpr uint8_t kIOReportFormatSimpleArray = 4;
 // The field category that the daily collection samples.
 inline constexpr uint16_t kIOReportCategoryField = 0x0100;
 
+// A channel type: the format in bits 0-7, the categories in bits 16-31 and
+// the element count in bits 32-47 (the element index above is not used).
+constexpr int64_t IOReportChannelType(uint8_t format, uint16_t categories, uint16_t elements) {
+  return static_cast<int64_t>(format | (uint64_t{categories} << 16) | (uint64_t{elements} << 32));
+}
+
 // Return codes this library adds to the registry's own.
 inline constexpr IOReturn kIOReturnBadLegend = static_cast<IOReturn>(0xE00002C9);
 inline constexpr IOReturn kIOReturnRegistryChanged = static_cast<IOReturn>(0xE00002EB);

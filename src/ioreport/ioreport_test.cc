@@ -11,18 +11,9 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "ioreport/test_legend.h"
 
 namespace {
-
-int64_t Type(uint8_t format, uint16_t categories, uint16_t elements) {
-  return static_cast<int64_t>(format | (uint64_t{categories} << 16) | (uint64_t{elements} << 32));
-}
-
-cf::Value Legend(int64_t id, int64_t type, const char* name = nullptr) {
-  cf::Array a({cf::Value::SInt64(id), cf::Value::SInt64(type)});
-  if (name) a.Append(name);
-  return a;
-}
 
 cf::Dictionary Channel(std::initializer_list<std::pair<const char*, cf::Value>> entries) { return Dict(entries); }
 
