@@ -1,6 +1,6 @@
 // The hub's buffer as it might arrive: raw sample bytes cut against one
-// fixed aggregate of channels of every format (built once), then everything
-// a sample can be asked is asked of each sample.
+// fixed aggregate of channels of every format (made for each input), then
+// everything a sample can be asked is asked of each sample.
 //
 // The aggregate, driver 0x10 throughout:
 //   1  simple, one element, unit and group "G"/"g"
@@ -22,8 +22,10 @@ uint64_t Type(uint8_t format, uint16_t categories, uint16_t elements) {
   return static_cast<uint64_t>(IOReportChannelType(format, categories, elements));
 }
 
-const cf::Value& Channels() {
-  static const cf::Value aggregate = [] {
+// Made anew for every input: a channel of unknown type keeps the type its
+// first sample gives it, and each input must start from the same channels.
+cf::Value Channels() {
+  return [] {
     cf::Value a = IOReportCreateAggregate(kIOReportByDriver | kIOReportByGroup);
     cf::Dictionary info;
     info.Set("IOReportChannelUnit", cf::Value::SInt64(0x0100007c00000000));
@@ -44,7 +46,6 @@ const cf::Value& Channels() {
     add(7, Type(1, 0x200, 1), {}, "H", {});
     return a;
   }();
-  return aggregate;
 }
 
 

@@ -133,7 +133,13 @@ int differenceLevel(const cf::Dictionary& later, const cf::Dictionary& earlier, 
       const auto key = keyOf(channel);
       if (!key) return kIOReportIterFailed;
       const cf::Dictionary* partner = nullptr;
-      const auto matches = [&](size_t j) { return keyOf(*(*e)[j].AsDictionary()) == key; };
+      // Every channel compared must have a type that can be read.
+      bool unreadable = false;
+      const auto matches = [&](size_t j) {
+        const auto other = keyOf(*(*e)[j].AsDictionary());
+        unreadable = unreadable || !other;
+        return other == key;
+      };
       if (e && i < e->size() && matches(i)) {
         partner = (*e)[i].AsDictionary();
       } else if (e) {
@@ -142,6 +148,7 @@ int differenceLevel(const cf::Dictionary& later, const cf::Dictionary& earlier, 
         if (j < e->size()) partner = (*e)[j].AsDictionary();
         stopped = j < e->size() ? j + 1 : j;
       }
+      if (unreadable) return kIOReportIterFailed;
       cf::Dictionary result = channel.MutableCopy();
       if (partner && difference(*partner, channel, result, error) != kIOReturnSuccess) return kIOReportIterFailed;
       results.Append(result);

@@ -88,14 +88,14 @@ TEST_F(IOReportSamplesTest, RawBuffersAreCutIntoRecords) {
   int64_t unit = 0;
   EXPECT_EQ(IOReportSimpleGetIntegerValue(by_name["Simple"], &unit), 250);
   EXPECT_EQ(unit, kIOReportInvalidValue);
-  // A channel asked for by ID takes its type from its record; the channel
-  // that was subscribed keeps the unknown type.
+  // A channel asked for by ID takes its type from its record, once: the
+  // channel that was subscribed keeps it for every later sample.
   EXPECT_EQ(IOReportChannelGetFormat(by_name["Learned"]), 1);
   EXPECT_EQ(IOReportChannelGetCategories(by_name["Learned"]), 0x0102);
   EXPECT_EQ(IOReportSimpleGetIntegerValue(by_name["Learned"], nullptr), 7);
   IOReportIterate(channels, [](const cf::Dictionary& c) {
     if (IOReportChannelGetChannelID(c) == 5) {
-      EXPECT_EQ(IOReportChannelGetFormat(c), 0);
+      EXPECT_EQ(IOReportChannelGetFormat(c), 1);
     }
     EXPECT_FALSE(c.Contains("RawElements"));
     return 0;
@@ -561,6 +561,13 @@ TEST(IOReportDeltaTest, AggregatesPairChannelsByDriverIDAndType) {
     return 0;
   });
   EXPECT_EQ(IOReportGetChannelCount(alone), 1);
+  // An earlier channel whose type cannot be read fails the delta when the
+  // search for a partner reaches it.
+  cf::Dictionary untyped = Sample(8, Type(1, 0, 1), {{1}});
+  untyped.Set("LegendChannel", cf::Array({cf::Value::SInt64(8), cf::Value("simple")}));
+  EXPECT_TRUE(IOReportCreateSamplesDelta(aggregate({untyped, Sample(1, Type(1, 0, 1), {{10}})}),
+                                         aggregate({Sample(1, Type(1, 0, 1), {{11}})}), &error)
+                  .IsNull());
 }
 
 std::string Right(size_t width, const std::string& text) {

@@ -253,11 +253,11 @@ cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw
         const size_t count = (type >> 32) & 0xFFFF;
         const size_t length = count * kIOReportElementSize;
         if (IOReportChannelGetFormat(channel) == kIOReportFormatUnknown) {
-          // Channels asked for by ID learn their type from the first sample.
-          if (const cf::Array* legend = channel.Get("LegendChannel").AsArray()) {
-            cf::Array learned = legend->MutableCopy();
-            if (learned.size() >= 2) learned.Set(1, cf::Value::SInt64(static_cast<int64_t>(type)));
-            copy.Set("LegendChannel", learned);
+          // Channels asked for by ID learn their type from the first sample,
+          // once: the legend is shared with the channel that was subscribed.
+          if (const cf::Array* legend = channel.Get("LegendChannel").AsArray(); legend && legend->size() >= 2) {
+            cf::Array shared = *legend;
+            shared.Set(1, cf::Value::SInt64(static_cast<int64_t>(type)));
           }
         }
         if (length > usable - *at) {
