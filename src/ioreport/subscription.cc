@@ -3,6 +3,7 @@
 #include <optional>
 #include <vector>
 
+#include "cf/bytes.h"
 #include "ioreport/internal.h"
 #include "ioreport/samples.h"
 #include "platform/log.h"
@@ -19,14 +20,6 @@ constexpr uint32_t kIOReportUserClientUpdateKernelBuffer = 3;
 // Interest lists of this many entries or more would not fit their size in 32 bits.
 constexpr uint64_t kMaxInterests = 89478478;
 
-uint64_t readU64(const uint8_t* p) {
-  uint64_t v;
-  std::memcpy(&v, p, 8);
-  return v;
-}
-
-void writeU64(uint8_t* p, uint64_t v) { std::memcpy(p, &v, 8); }
-
 // n, then (driver ID, channel ID, type) per channel in walk order; empty on
 // failure.
 std::vector<uint8_t> createInterestList(const cf::Value& channels, int n) {
@@ -42,9 +35,9 @@ std::vector<uint8_t> createInterestList(const cf::Value& channels, int n) {
     if (driver == kIOReportInvalidValue || id == kIOReportInvalidValue || !type || written >= n)
       return kIOReportIterFailed;
     uint8_t* entry = list.data() + 8 + 24 * static_cast<size_t>(written);
-    writeU64(entry, static_cast<uint64_t>(driver));
-    writeU64(entry + 8, static_cast<uint64_t>(id));
-    writeU64(entry + 16, *type);
+    cf::StoreLE64(entry, static_cast<uint64_t>(driver));
+    cf::StoreLE64(entry + 8, static_cast<uint64_t>(id));
+    cf::StoreLE64(entry + 16, *type);
     ++written;
     return kIOReportIterOk;
   });
@@ -176,7 +169,7 @@ class RecordIndex {
   RecordIndex(const uint8_t* base, size_t usable) : base_(base) {
     std::vector<size_t> starts;
     for (size_t at = 0; at + kIOReportElementSize <= usable;) {
-      const size_t count = (readU64(base + at + 16) >> 32) & 0xFFFF;
+      const size_t count = (cf::LoadLE64(base + at + 16) >> 32) & 0xFFFF;
       if (count == 0) {
         ends_without_elements_ = true;
         break;
@@ -189,7 +182,7 @@ class RecordIndex {
     while (capacity < 2 * starts.size()) capacity *= 2;
     slots_.assign(capacity, 0);
     for (const size_t at : starts) {
-      const uint64_t driver = readU64(base + at), id = readU64(base + at + 8);
+      const uint64_t driver = cf::LoadLE64(base + at), id = cf::LoadLE64(base + at + 8);
       for (size_t s = slotOf(driver, id);; s = (s + 1) & (capacity - 1)) {
         if (slots_[s] == 0) {
           slots_[s] = at + 1;
@@ -218,7 +211,7 @@ class RecordIndex {
     return static_cast<size_t>(h) & (slots_.size() - 1);
   }
   bool matches(size_t at, uint64_t driver, uint64_t id) const {
-    return readU64(base_ + at) == driver && readU64(base_ + at + 8) == id;
+    return cf::LoadLE64(base_ + at) == driver && cf::LoadLE64(base_ + at + 8) == id;
   }
 
   const uint8_t* base_;
@@ -249,7 +242,7 @@ cf::Value createSamplesFromBytes(const cf::Value& channels, std::string_view raw
           return kIOReportIterSkipped;
         }
         const uint8_t* record = base + *at;
-        const uint64_t type = readU64(record + 16);
+        const uint64_t type = cf::LoadLE64(record + 16);
         const size_t count = (type >> 32) & 0xFFFF;
         const size_t length = count * kIOReportElementSize;
         if (IOReportChannelGetFormat(channel) == kIOReportFormatUnknown) {

@@ -14,6 +14,7 @@
 // array of selector numbers) and "failMap" (a boolean) break those calls.
 #include <cstring>
 
+#include "cf/bytes.h"
 #include "sim/device.h"
 #include "sim/user_clients.h"
 
@@ -34,14 +35,6 @@ struct Interest {
   uint64_t channel_id = 0;
   uint64_t type = 0;
 };
-
-uint64_t ReadU64(const uint8_t* p) {
-  uint64_t v;
-  std::memcpy(&v, p, 8);
-  return v;
-}
-
-void WriteU64(uint8_t* p, uint64_t v) { std::memcpy(p, &v, 8); }
 
 int64_t NumberOr0(const cf::Value& v) {
   const cf::Number* n = v.AsNumber();
@@ -111,7 +104,7 @@ class HubClient : public UserClient {
     size_t total = 0;
     for (uint32_t k = 0; k < n; ++k) {
       const uint8_t* entry = in + 8 + 24 * static_cast<size_t>(k);
-      Interest interest{ReadU64(entry), ReadU64(entry + 8), ReadU64(entry + 16)};
+      Interest interest{cf::LoadLE64(entry), cf::LoadLE64(entry + 8), cf::LoadLE64(entry + 16)};
       const auto type = LegendType(registry, interest.driver_id, interest.channel_id);
       if (!type) continue;  // the hub knows no such channel
       interest.type = *type;
@@ -150,10 +143,10 @@ class HubClient : public UserClient {
       const size_t count = Elements(interest);
       for (size_t e = 0; e < count; ++e, p += kElementSize) {
         std::memset(p, 0, kElementSize);
-        WriteU64(p, interest.driver_id);
-        WriteU64(p + 8, interest.channel_id);
+        cf::StoreLE64(p, interest.driver_id);
+        cf::StoreLE64(p + 8, interest.channel_id);
         // The element's own index sits in the type's top 16 bits.
-        WriteU64(p + 16, (interest.type & 0x0000FFFFFFFFFFFFull) | (static_cast<uint64_t>(e & 0xFFFF) << 48));
+        cf::StoreLE64(p + 16, (interest.type & 0x0000FFFFFFFFFFFFull) | (static_cast<uint64_t>(e & 0xFFFF) << 48));
         int64_t slots[4] = {0, 0, 0, 0};
         int64_t time = 0;
         if (const cf::Array* per_element = answer.AsArray()) {
@@ -167,8 +160,8 @@ class HubClient : public UserClient {
         } else if (e == 0) {
           slots[0] = NumberOr0(answer);
         }
-        WriteU64(p + 24, static_cast<uint64_t>(time));
-        for (size_t i = 0; i < 4; ++i) WriteU64(p + 32 + 8 * i, static_cast<uint64_t>(slots[i]));
+        cf::StoreLE64(p + 24, static_cast<uint64_t>(time));
+        for (size_t i = 0; i < 4; ++i) cf::StoreLE64(p + 32 + 8 * i, static_cast<uint64_t>(slots[i]));
       }
     }
     return kIOReturnSuccess;

@@ -16,6 +16,7 @@
 #include <optional>
 #include <vector>
 
+#include "cf/bytes.h"
 #include "nandinfo/controller.h"
 #include "nandinfo/nandinfo_dict.h"
 #include "platform/clock.h"
@@ -34,12 +35,6 @@ struct WriteAmplification {
   bool above_threshold = false;
 };
 WriteAmplification g_amplification;
-
-uint32_t ReadU32(const uint8_t* data, size_t offset) {
-  uint32_t v;
-  std::memcpy(&v, data + offset, 4);  // little-endian, as the controller writes
-  return v;
-}
 
 // The user and intermediate write amplification from the statistics; both
 // 0 when they cannot be fetched.
@@ -187,15 +182,15 @@ bool DumpStorageStructuredLog(bool verbose) {
 }
 
 std::optional<std::array<cf::Array, 16>> ValidityValues(const uint8_t* data, size_t size) {
-  const uint64_t count = size >= 8 ? ReadU32(data, 0) : 0;
-  const uint64_t extra = size >= 8 ? ReadU32(data, 4) : 0;
+  const uint64_t count = size >= 8 ? cf::LoadLE32(data) : 0;
+  const uint64_t extra = size >= 8 ? cf::LoadLE32(data + 4) : 0;
   if (count == 0 || size < 4 * (2 + 2 * extra + 5 * count)) return std::nullopt;
   std::array<cf::Array, 16> lists;
   const size_t entries = 8 + 8 * extra;
   for (uint64_t e = 0; e < count; ++e) {
     const size_t at = entries + 20 * e;
-    const uint32_t list = ReadU32(data, at + 4);
-    if (list < lists.size()) lists[list].Append(cf::Value::SInt32(static_cast<int32_t>(ReadU32(data, at + 8))));
+    const uint32_t list = cf::LoadLE32(data + at + 4);
+    if (list < lists.size()) lists[list].Append(cf::Value::SInt32(static_cast<int32_t>(cf::LoadLE32(data + at + 8))));
   }
   return lists;
 }
@@ -221,16 +216,16 @@ bool ForEachDefectRecord(const uint8_t* data, size_t size, const cf::Value& char
                          std::string_view class_name, const std::function<void(const cf::Dictionary&)>& each) {
   if (size < 12) return false;
   cf::Dictionary header;
-  header.Set("Factory Count", cf::Value::SInt32(static_cast<int32_t>(ReadU32(data, 4))));
+  header.Set("Factory Count", cf::Value::SInt32(static_cast<int32_t>(cf::LoadLE32(data + 4))));
   if (const cf::Dictionary* c = characteristics.AsDictionary())
     if (const cf::Number* desc = c->Get("nand-device-desc").AsNumber())
       header.Set("com.velmora.NANDInfo.nandDesc", cf::Value::SInt32(desc->AsSInt32()));
   each(header);
   // Entries go as far as the bytes do, whatever the count claims.
-  const uint64_t count = std::min<uint64_t>(ReadU32(data, 8), (size - 12) / 32);
+  const uint64_t count = std::min<uint64_t>(cf::LoadLE32(data + 8), (size - 12) / 32);
   for (uint64_t e = 0; e < count; ++e) {
     const uint8_t* entry = data + 12 + 32 * e;
-    auto word = [&](size_t w) { return ReadU32(entry, 4 * w); };
+    auto word = [&](size_t w) { return cf::LoadLE32(entry + 4 * w); };
     uint32_t reason = word(4);
     if (class_name != "VSPStorage") {
       switch (const uint32_t mode = word(7)) {

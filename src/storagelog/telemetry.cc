@@ -7,6 +7,7 @@
 #include <span>
 #include <string>
 
+#include "cf/bytes.h"
 #include "nandinfo/helpers.h"
 #include "platform/diagnostics.h"
 #include "storagelog/telemetry_layouts.h"
@@ -25,16 +26,9 @@ constexpr uint64_t kNandKeyMask = 0xFFFFFFFFFF00;
 
 constexpr size_t kChipIdBytes = 64;
 
-uint32_t Le32(const uint8_t* p) {
-  uint32_t v;
-  std::memcpy(&v, p, 4);
-  if constexpr (std::endian::native == std::endian::big) v = __builtin_bswap32(v);
-  return v;
-}
-
 void CopyRuns(std::span<const WordRun> runs, const uint8_t* block, VendorCounters* counters) {
   for (const WordRun& r : runs)
-    for (size_t i = 0; i < r.count; ++i) counters->words[r.dest + i] = Le32(block + 4 * (r.src + i));
+    for (size_t i = 0; i < r.count; ++i) counters->words[r.dest + i] = cf::LoadLE32(block + 4 * (r.src + i));
 }
 
 void parseOnlyAlgoGenericCounters(const uint8_t* block, VendorCounters* counters) {
@@ -163,7 +157,7 @@ bool ParseTelemetryList(const uint8_t* data, size_t size, const cf::Value& chara
     record.Reserve(std::size(kBusSummaryKeys) + kVendorCounterWords);
     const uint8_t* summary = summaries + bus * kTelemetrySummaryBytes;
     for (size_t i = 0; i < std::size(kBusSummaryKeys); ++i)
-      record.AppendUnique(kBusSummaryKeys[i], cf::Value::SInt32(static_cast<int32_t>(Le32(summary + 4 * i))));
+      record.AppendUnique(kBusSummaryKeys[i], cf::Value::SInt32(static_cast<int32_t>(cf::LoadLE32(summary + 4 * i))));
     for (const CounterNames& group : kCounterNames) {
       for (int i = 0; i < group.count[kind]; ++i) {
         std::snprintf(name, sizeof name, "%s[%d]", group.name, i);
