@@ -6,8 +6,7 @@
 namespace nandinfo {
 namespace {
 
-// Each whitelist is kept in byte order of its names, with no name twice, so a
-// lookup may binary-search it.
+// Checked at compile time for each whitelist: names in byte order, none twice.
 constexpr bool SortedAndUnique(std::span<const SigDigits> rows) {
   return std::ranges::adjacent_find(rows, [](const SigDigits& a, const SigDigits& b) {
            return a.name >= b.name;

@@ -8,7 +8,9 @@
 
 namespace nandinfo {
 
-// A whitelisted field and its number of significant digits.
+// A whitelisted field and its number of significant digits. Each whitelist is
+// sorted by name in byte order, with no name twice, so a lookup may
+// binary-search it; a name not in it is dropped from the view.
 struct SigDigits {
   std::string_view name;
   int digits;
