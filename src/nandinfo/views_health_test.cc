@@ -13,6 +13,7 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "sim/default_device.h"
 
 namespace {
 
@@ -94,6 +95,16 @@ TEST_F(ViewsHealthTest, ImageQueriesAnswerFromTheDriverAndSayWhyNot) {
   EXPECT_EQ(GetEANUpdateCount(kIFW1), 0u);
   EXPECT_EQ(log->Count("GetImageSize: IOConnectCallMethod failed (key (1768322865): ifw1) kernResult:e00002f0"), 1u);
   EXPECT_EQ(log->Count("GetUpdateCount: IOConnectCallMethod failed (key (1768322865): ifw1) kernResult:e00002f0"), 1u);
+}
+
+TEST_F(ViewsHealthTest, TheDefaultDeviceAnswersTheImageFiguresTheStorageViewReports) {
+  const sim::DefaultDevice device = sim::DefaultStorageDevice();
+  Write("registry.plist", device.registry);
+  Write("ean.plist", device.ean);
+  for (const uint32_t key : {kDBIC, 0x644C5448u}) EXPECT_GT(GetEANImageSize(key), 0u) << std::hex << key;
+  for (const uint32_t key : {kDBIC, 0x644C5448u, kIFW1, 0x64436667u, 0x66436667u, 0x6E656677u, kLPEM})
+    EXPECT_GT(GetEANUpdateCount(key), 0u) << std::hex << key;
+  EXPECT_TRUE(log->lines().empty());
 }
 
 TEST_F(ViewsHealthTest, AMalformedImageFileFailsOnlyTheQueryItSpoils) {
