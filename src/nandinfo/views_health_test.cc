@@ -136,9 +136,14 @@ TEST_F(ViewsHealthTest, AMalformedImageFileFailsOnlyTheQueryItSpoils) {
               c.failing)
         << c.complaint;
   }
-  // Not a property list at all: every image is unknown.
+  // Not a property list at all: every image is unknown, and the file is
+  // named once however often it is asked.
   WriteRaw("ean.plist", "<plist><dict><key>dBIC");
+  log->Clear();
   EXPECT_EQ(GetEANImageSize(kDBIC), 0u);
+  EXPECT_EQ(GetEANUpdateCount(kDBIC), 0u);
+  EXPECT_EQ(log->CountContaining("ean.plist is not a property list"), 1u);
+  EXPECT_EQ(log->CountContaining("kernResult:e00002f0"), 2u);
 
   // The driver's own checks of what it is asked.
   Write("ean.plist", Dict({{"dBIC", Dict({{"size", S32(9)}})}}));
