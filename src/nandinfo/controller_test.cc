@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <thread>
 
+#include "../../tests/stream_capture.h"
 #include "../../tests/temp_dir.h"
 #include "cf/plist.h"
 #include "platform/context.h"
@@ -14,34 +15,6 @@
 #include "sim/statistics_buffers.h"
 
 namespace {
-
-// What a block printed on one of the standard streams.
-class StreamCapture {
- public:
-  explicit StreamCapture(FILE* stream) : stream_(stream), fd_(fileno(stream)) {
-    std::fflush(stream_);
-    saved_ = dup(fd_);
-    file_ = std::tmpfile();
-    dup2(fileno(file_), fd_);
-  }
-  std::string Text() {
-    std::fflush(stream_);
-    dup2(saved_, fd_);
-    close(saved_);
-    std::string out;
-    std::rewind(file_);
-    char buf[4096];
-    size_t n;
-    while ((n = std::fread(buf, 1, sizeof buf, file_)) > 0) out.append(buf, n);
-    std::fclose(file_);
-    return out;
-  }
-
- private:
-  FILE* stream_;
-  int fd_, saved_ = -1;
-  FILE* file_ = nullptr;
-};
 
 cf::Dictionary Service(const char* cls, uint64_t id, bool openable = true) {
   cf::Dictionary d;

@@ -193,6 +193,12 @@ DefaultDevice DefaultStorageDevice() {
              {"parent", cf::Value::UInt64(0x100000100)},
              {"userClient", "nvme"},
              {"properties", Entry({{"Controller Characteristics", characteristics}})}}),
+      // The image driver sits below the controller whose images it keeps.
+      Entry({{"class", "VelmoraNVMeEAN"},
+             {"name", "ean"},
+             {"id", cf::Value::UInt64(0x100000A40)},
+             {"parent", cf::Value::UInt64(0x100000A2F)},
+             {"userClient", "ean"}}),
       // The reporting hub and two drivers that publish reporting channels:
       // simple ones of the field category become the daily ioreport keys,
       // the state, histogram and other-category ones do not.
@@ -254,6 +260,16 @@ DefaultDevice DefaultStorageDevice() {
                {"2", cf::Value::SInt64(7)},
                {"3", cf::Array({Values({120, 20, 95, 7600}), Values({40, 105, 198, 5800}), Values({3, 210, 290, 750}),
                                 Values({0, 0, 0, 0})})}})}});
+  // The images: boot and firmware images written a handful of times in
+  // the device's life, configurations more often. The last one reports only
+  // its updates.
+  device.ean = Entry({{"dBIC", Numbers({{"size", 262144}, {"updates", 3}})},
+                      {"dLTH", Numbers({{"size", 1048576}, {"updates", 12}})},
+                      {"ifw1", Numbers({{"size", 786432}, {"updates", 4}})},
+                      {"dCfg", Numbers({{"size", 16384}, {"updates", 27}})},
+                      {"fCfg", Numbers({{"size", 8192}, {"updates", 9}})},
+                      {"nefw", Numbers({{"size", 2097152}, {"updates", 4}})},
+                      {"LPEM", Numbers({{"updates", 1}})}});
   device.controller = Entry({{"stats", FtlFields()},
                              {"msp", cf::Array({MspFields(0), MspFields(1)})},
                              {"bandStats", ValidityList()},

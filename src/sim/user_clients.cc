@@ -15,6 +15,7 @@ struct Kind {
 constexpr Kind kKinds[] = {
     {"nvme", &CreateNvmeClient},
     {"hub", &CreateHubClient},
+    {"ean", &CreateEanClient},
 };
 
 }  // namespace

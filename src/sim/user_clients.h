@@ -9,5 +9,6 @@ namespace sim {
 
 std::unique_ptr<UserClient> CreateNvmeClient(const Service& service, DeviceFiles& files);
 std::unique_ptr<UserClient> CreateHubClient(const Service& service, DeviceFiles& files);
+std::unique_ptr<UserClient> CreateEanClient(const Service& service, DeviceFiles& files);
 
 }  // namespace sim

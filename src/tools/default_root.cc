@@ -236,7 +236,8 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
       !WritePlist(c.Path("/device/stackshot.plist"), device.stackshot, error) ||
       !WritePlist(c.Path("/device/purgeable.plist"), device.purgeable, error) ||
       !WritePlist(c.Path("/device/ecc-events.plist"), device.ecc_events, error) ||
-      !WritePlist(c.Path("/device/ioreport.plist"), device.ioreport, error))
+      !WritePlist(c.Path("/device/ioreport.plist"), device.ioreport, error) ||
+      !WritePlist(c.Path("/device/ean.plist"), device.ean, error))
     return false;
   if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
   if (!WritePlist(c.Path(kUsageDevicePath), Usage(TBDaysSince1970()), error)) return false;
