@@ -8,18 +8,25 @@
 #include "cf/plist.h"
 #include "platform/files.h"
 
-// The records of one type in a structured-data log (JSON lines), in order.
-inline std::vector<cf::Dictionary> StructuredRecords(const std::string& path, int type) {
+// The objects of a file of JSON lines, in order (other lines skipped).
+inline std::vector<cf::Dictionary> JSONLines(const std::string& path) {
   std::vector<cf::Dictionary> out;
   const std::string text = platform::ReadFile(path).value_or("");
   for (size_t start = 0; start < text.size();) {
     const size_t end = text.find('\n', start);
     const cf::Value line = cf::ParseJSON(text.substr(start, end - start)).value;
     start = end == std::string::npos ? text.size() : end + 1;
-    const cf::Dictionary* d = line.AsDictionary();
-    if (d && d->Get("type") == cf::Value::SInt32(type) && d->Get("record").AsDictionary())
-      out.push_back(*d->Get("record").AsDictionary());
+    if (const cf::Dictionary* d = line.AsDictionary()) out.push_back(*d);
   }
+  return out;
+}
+
+// The records of one type in a structured-data log (JSON lines), in order.
+inline std::vector<cf::Dictionary> StructuredRecords(const std::string& path, int type) {
+  std::vector<cf::Dictionary> out;
+  for (const cf::Dictionary& d : JSONLines(path))
+    if (d.Get("type") == cf::Value::SInt32(type) && d.Get("record").AsDictionary())
+      out.push_back(*d.Get("record").AsDictionary());
   return out;
 }
 

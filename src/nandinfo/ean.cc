@@ -1,27 +1,18 @@
 // The image driver's client: every query finds the driver, opens it, asks
 // one scalar question and gives everything back, so nothing is held
 // between queries.
-#include <cstdio>
 #include <string>
 
 #include "cf/format.h"
+#include "nandinfo/helpers.h"
 #include "nandinfo/views.h"
 #include "platform/iokit.h"
-#include "platform/log.h"
 
 namespace {
 
 constexpr const char* kEANClass = "VelmoraNVMeEAN";
 constexpr uint32_t kImageSizeMethod = 3;
 constexpr uint32_t kUpdateCountMethod = 7;
-
-// These lines go to the system log and to standard error alike.
-template <typename... A>
-void Say(std::string_view format, const A&... args) {
-  const std::string line = cf::Format(format, args...);
-  platform::LogDefault("%s", line);
-  std::fprintf(stderr, "%s\n", line.c_str());
-}
 
 // The key's four characters, most significant byte first, for %c%c%c%c.
 unsigned char KeyChar(uint32_t key, int i) { return static_cast<unsigned char>(key >> (24 - 8 * i)); }
@@ -43,7 +34,7 @@ uint64_t Ask(const Query& q, uint32_t key) {
   uint32_t output_count = 1;
   const int k0 = KeyChar(key, 0), k1 = KeyChar(key, 1), k2 = KeyChar(key, 2), k3 = KeyChar(key, 3);
   if (!getEANConnection(&c)) {
-    Say("%s: Unable to get EAN Io service connection for key (%u): %c%c%c%c", q.caller, key, k0, k1, k2, k3);
+    SayNANDInfoF("%s: Unable to get EAN Io service connection for key (%u): %c%c%c%c", q.caller, key, k0, k1, k2, k3);
     Release(c);  // a service that could not be opened is still ours
     return 0;
   }
@@ -52,7 +43,7 @@ uint64_t Ask(const Query& q, uint32_t key) {
   const kern_return_t rc =
       IOConnectCallMethod(c.connection, q.selector, &input, 1, nullptr, 0, &output, &output_count, nullptr, nullptr);
   if (rc != kIOReturnSuccess)
-    Say("%s: IOConnectCallMethod failed (key (%u): %c%c%c%c) kernResult:%x", q.method, key, k0, k1, k2, k3,
+    SayNANDInfoF("%s: IOConnectCallMethod failed (key (%u): %c%c%c%c) kernResult:%x", q.method, key, k0, k1, k2, k3,
         static_cast<uint32_t>(rc));
   else
     answer = output;
@@ -67,13 +58,13 @@ uint64_t Ask(const Query& q, uint32_t key) {
 bool getEANConnection(EANConnection* c) {
   c->service = IOServiceGetMatchingService(kIOMainPortDefault, IOServiceMatching(kEANClass));
   if (!c->service) {
-    Say("getEANConnection: Couldn't find %s object", kEANClass);
+    SayNANDInfoF("getEANConnection: Couldn't find %s object", kEANClass);
     return false;
   }
   const kern_return_t rc = IOServiceOpen(c->service, mach_task_self(), 0, &c->connection);
   if (rc != kIOReturnSuccess) {
     c->connection = 0;
-    Say("getEANConnection: IOServiceOpen on %s failed kernResult:%x", kEANClass, static_cast<uint32_t>(rc));
+    SayNANDInfoF("getEANConnection: IOServiceOpen on %s failed kernResult:%x", kEANClass, static_cast<uint32_t>(rc));
     return false;
   }
   return true;

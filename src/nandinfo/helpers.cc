@@ -183,3 +183,9 @@ uint64_t roundSig(uint64_t value, uint64_t digits) {
   if (r >= p / 2) ++q;
   return q * p;
 }
+
+void SayNANDInfo(std::string_view line) {
+  if (!line.empty() && line.back() == '\n') line.remove_suffix(1);
+  platform::LogDefault("%s", std::string(line));
+  std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
+}

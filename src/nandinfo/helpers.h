@@ -8,6 +8,9 @@
 #include <cstddef>
 #include <cstdint>
 
+#include <string_view>
+
+#include "cf/format.h"
 #include "cf/value.h"
 #include "parsers/context.h"
 
@@ -34,3 +37,11 @@ uint8_t hexStringToByte(const char* text, size_t length);
 uint32_t hexStringToInt32(const char* text, size_t length);
 int32_t GetUserCapacityInGB(uint32_t mebibytes);
 uint64_t roundSig(uint64_t value, uint64_t digits);
+
+// A progress line of the service: to the system log and to standard error
+// (one trailing newline of the text is the line's end).
+void SayNANDInfo(std::string_view line);
+template <typename... A>
+void SayNANDInfoF(std::string_view format, const A&... args) {
+  SayNANDInfo(cf::Format(format, args...));
+}

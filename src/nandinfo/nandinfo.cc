@@ -19,12 +19,6 @@
 
 namespace {
 
-// The service's progress lines go to the system log and to standard error.
-void Say(const std::string& line) {
-  platform::LogDefault("%s", line);
-  std::fprintf(stderr, "%s\n", line.c_str());
-}
-
 constexpr const char* kPurgeable = "ESR_Purgewell_totalPurgeable";
 constexpr const char* kNonPurgeable = "ESR_Purgewell_totalNonPurgeable";
 
@@ -158,7 +152,7 @@ cf::Value CopyNANDInfo() {
 
 cf::Value CopyNANDInfoWithOptions(uint64_t options) {
   if (options & 2) {
-    Say("NANDInfo: CopyNANDInfoWithOptions: testing ...");
+    SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: testing ...");
     return createAndLogNANDFieldsToEventLens(0);
   }
   char session[100] = {};
@@ -168,20 +162,20 @@ cf::Value CopyNANDInfoWithOptions(uint64_t options) {
 
   std::optional<cf::Dictionary> result;
   if (analytics_day) {
-    Say("NANDInfo: CopyNANDInfoWithOptions: logging FTL data to EL");
+    SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: logging FTL data to EL");
     if (options & 1) {
-      Say("NANDInfo: CopyNANDInfoWithOptions: logging FTL big views to EL");
+      SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: logging FTL big views to EL");
       const cf::Value ftl = createAndLogNANDFieldsToEventLens(1);
       if (const cf::Dictionary* d = ftl.AsDictionary()) {
         result = *d;
       } else {
         SetAPIErrorMessage("CopyNANDInfoWithOptions: Unable to log FTL Fields to EL");
-        Say("NANDInfo: CopyNANDInfoWithOptions: Unable to log FTL Fields to EL");
+        SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: Unable to log FTL Fields to EL");
       }
     }
   }
   for (const auto& [selector, name] : {std::pair<int, const char*>{2, "MSP"}, {3, "StorageStats"}}) {
-    Say(std::string("NANDInfo: CopyNANDInfoWithOptions: logging ") + (selector == 2 ? "MSP big view" : "StorageStats view") +
+    SayNANDInfo(std::string("NANDInfo: CopyNANDInfoWithOptions: logging ") + (selector == 2 ? "MSP big view" : "StorageStats view") +
         " to EL");
     const cf::Value view = createAndLogNANDFieldsToEventLens(selector);
     if (const cf::Dictionary* d = view.AsDictionary()) {
@@ -189,13 +183,13 @@ cf::Value CopyNANDInfoWithOptions(uint64_t options) {
         for (const auto& [key, value] : *d) result->Set(key, value);
     } else {
       SetAPIErrorMessage("CopyNANDInfoWithOptions: Unable to log %s Fields to EL", name);
-      Say(std::string("NANDInfo: CopyNANDInfoWithOptions: Unable to log ") + name + " Fields to EL");
+      SayNANDInfo(std::string("NANDInfo: CopyNANDInfoWithOptions: Unable to log ") + name + " Fields to EL");
     }
   }
 
   cf::Value tbkd;
   if (analytics_day && (options & 1)) {
-    Say("NANDInfo: CopyNANDInfoWithOptions: logging FTL smaller views to EL");
+    SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: logging FTL smaller views to EL");
     if (platform::AnalyticsAvailable()) {
       const cf::Dictionary esr = gatherVSPFTLOtherData(cf::Value());
       const int64_t freezer = S32(esr, "ESR_VMFreezer_bytesWritten").value_or(0);
@@ -206,23 +200,19 @@ cf::Value CopyNANDInfoWithOptions(uint64_t options) {
       if (!groups_tbkd.IsNull()) SendReferenceMapGroupEvents(groups_tbkd, freezer, capacity_mb, free_mb);
     }
   } else if (!analytics_day) {
-    Say("NANDInfo: CopyNANDInfoWithOptions: obtaining FTL data for TBKD");
+    SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: obtaining FTL data for TBKD");
     tbkd = CopyNANDInfo();
     if (tbkd.IsNull()) {
       SetAPIErrorMessage("CopyNANDInfoWithOptions: Unable to get FTL Fields for TBKD");
-      Say("NANDInfo: CopyNANDInfoWithOptions: Unable to get FTL Fields for TBKD");
+      SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: Unable to get FTL Fields for TBKD");
     }
   }
   if (result) result->Set("com.velmora.NANDInfo.ErrorMessage", GetAPIErrorMessage());
   if (analytics_day) {
     if (result) result->Set("ESR_APIErrorMessage", GetAPIErrorMessage());
-    Say("NANDInfo: CopyNANDInfoWithOptions: returning EL dictionary");
+    SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: returning EL dictionary");
     return result ? cf::Value(*result) : cf::Value();
   }
-  Say("NANDInfo: CopyNANDInfoWithOptions: returning TBKD dictionary");
+  SayNANDInfo("NANDInfo: CopyNANDInfoWithOptions: returning TBKD dictionary");
   return tbkd;
 }
-
-// Seams filled by the views and the group events.
-cf::Value createAndLogNANDFieldsToEventLens(int) { return {}; }
-void SendReferenceMapGroupEvents(const cf::Value&, int64_t, int64_t, int64_t) {}

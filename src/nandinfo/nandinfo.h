@@ -29,8 +29,7 @@ bool IsEventLensDay(char first, int64_t seconds);
 // Views of the controller's statistics sent to the analytics service:
 // selector 0 all three at once, 1 the FTL views, 2 the MSP view, 3 the
 // storage statistics. The union of what was sent, or null.
-// (A seam until the views are built: sends nothing and returns null.)
 cf::Value createAndLogNANDFieldsToEventLens(int selector);
 // The reference map's group events for the TBKD dictionary and three disk
-// figures. (A seam until the group events are built: sends nothing.)
+// figures.
 void SendReferenceMapGroupEvents(const cf::Value& tbkd, int64_t freezerBytes, int64_t capacityMB, int64_t freeMB);

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "cf/plist.h"
+#include "nandinfo/view_tables.h"
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/faultkeep.h"
@@ -76,6 +77,15 @@ cf::Dictionary SysctlProfile() {
   cf::Dictionary d;
   for (const auto& [name, value] : values) d.Set(name, cf::Value::SInt64(value));
   return d;
+}
+
+// The analytics events in use: the app installs, the storage views and the
+// reference map's group events.
+cf::Array EnabledEvents() {
+  cf::Array events({cf::Value("com.velmora.homedeck.appInstalls")});
+  for (const nandinfo::EventFields& e : nandinfo::EventLensConfigDetails()) events.Append(cf::Value(e.event));
+  for (std::string_view group : nandinfo::EventLensEvents()) events.Append(cf::Value(group));
+  return events;
 }
 
 cf::Array Apps() {
@@ -241,9 +251,7 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
     return false;
   if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
   if (!WritePlist(c.Path(kUsageDevicePath), Usage(TBDaysSince1970()), error)) return false;
-  if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), cf::Array({cf::Value("com.velmora.homedeck.appInstalls")}),
-                  error))
-    return false;
+  if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), EnabledEvents(), error)) return false;
   const auto library = platform::ReadFile(support_library, error);
   if (!library || !platform::WriteFileAtomically(c.Path(kFaultkeepSupportPath), *library, error, 0755)) return false;
 

@@ -16,6 +16,7 @@
 #include "ioreport/ioreport.h"
 #include "ioreport/samples.h"
 #include "nandinfo/nandinfo.h"
+#include "nandinfo/views.h"
 #include "parsers/parsers.h"
 #include "platform/context.h"
 #include "platform/files.h"
@@ -129,6 +130,27 @@ int Controller(const std::string& root) {
                  GetAPIErrorMessage().c_str());
     return 1;
   }
+  return 0;
+}
+
+// Every view a root's storage device gives: the three whitelisted sources,
+// the health, lab and OTA views and the content-deletion answer.
+int Views(const std::string& root, bool round) {
+  platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  cf::Dictionary views;
+  views.Set("FTL", CopyWhitelistedNANDFTLInfo(round));
+  views.Set("MSP", CopyWhitelistedNANDMSPInfo(round));
+  views.Set("StorageStats", CopyWhitelistedStorageStats(round));
+  views.Set("Health", CopyHalvernNANDInfo());
+  views.Set("InternalLab", CopyInternalLabNANDInfo());
+  views.Set("OTA", CopyOTANANDInfo());
+  views.Set("ContentDeletion", NandRecommendsContentDeletion());
+  std::string json, error;
+  if (!cf::WriteJSON(views, json, &error, 2)) {
+    std::fprintf(stderr, "devsim: %s\n", error.c_str());
+    return 1;
+  }
+  std::printf("%s\n", json.c_str());
   return 0;
 }
 
@@ -251,6 +273,11 @@ int main(int argc, char** argv) {
   std::string controller_root;
   auto* controller = app.add_subcommand("controller", "Print the NAND info a root's controller gives, as JSON");
   controller->add_option("ROOT", controller_root, "the device root (default: TALLYRUN_ROOT)");
+  std::string views_root;
+  bool round = false;
+  auto* views = app.add_subcommand("views", "Print the analytics, health, lab and OTA views a root gives, as JSON");
+  views->add_option("ROOT", views_root, "the device root (default: TALLYRUN_ROOT)");
+  views->add_flag("--round", round, "round each field to its significant digits");
   std::string reporting_root;
   int64_t categories = -1;
   bool reporting_json = false;
@@ -270,6 +297,7 @@ int main(int argc, char** argv) {
   if (parse->parsed()) return Parse(kind, file);
   if (snapshot->parsed()) return Snapshot(file, header_file);
   if (controller->parsed()) return Controller(controller_root);
+  if (views->parsed()) return Views(views_root, round);
   if (reporting->parsed()) return Reporting(reporting_root, categories, reporting_json, interval);
   if (init->parsed()) {
     std::error_code ec;

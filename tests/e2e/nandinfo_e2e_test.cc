@@ -1,5 +1,8 @@
 // The storage controller's figures through whole daily runs: on a day that
 // writes the store's NAND keys, and on a device without a controller.
+#include <set>
+
+#include "../records.h"
 #include "root_fixture.h"
 
 namespace {
@@ -12,9 +15,9 @@ class NANDInfoRun : public RootTest {
     env["TALLYRUN_NOW"] = "2026-11-21T15:00:00Z";
     RootTest::SetUp();
   }
-  std::map<std::string, std::string> Keys() {
+  std::map<std::string, std::string> Keys(const std::string& day = "20778", const std::string& prefix = "com.velmora.NANDInfo.") {
     std::map<std::string, std::string> out;
-    const RunResult dump = RunProgram(TALLYBOOK_BIN, {"dump", "--day", "20778", "--prefix", "com.velmora.NANDInfo."}, env);
+    const RunResult dump = RunProgram(TALLYBOOK_BIN, {"dump", "--day", day, "--prefix", prefix}, env);
     size_t start = 0;
     while (start < dump.out.size()) {
       const size_t end = dump.out.find('\n', start);
@@ -25,7 +28,81 @@ class NANDInfoRun : public RootTest {
     }
     return out;
   }
+  // The analytics events sent, in order, other than the app installs.
+  std::vector<cf::Dictionary> Events() {
+    std::vector<cf::Dictionary> out;
+    for (const cf::Dictionary& e : JSONLines(root / "var/eventlens/events.jsonl"))
+      if (e.Get("event") != cf::Value("com.velmora.homedeck.appInstalls")) out.push_back(e);
+    return out;
+  }
 };
+
+TEST_F(NANDInfoRun, AnAnalyticsDaySendsEveryViewAndStoresTheNumbers) {
+  // 2026-11-22 is day 20779, odd like the boot session's first digit.
+  env["TALLYRUN_NOW"] = "2026-11-22T15:00:00Z";
+  const RunResult r = Tallyrun({"-f"});
+  std::map<std::string, std::vector<cf::Dictionary>> sent;
+  for (const cf::Dictionary& e : Events()) sent[*e.Get("event").AsString()].push_back(*e.Get("payload").AsDictionary());
+  EXPECT_EQ(sent.size(), 4u + 36u) << r.err;
+  for (const auto& [event, payloads] : sent)
+    EXPECT_EQ(payloads.size(), event == "com.velmora.massStorage.NANDInfo.MSPCounters_1" ? 2u : 1u) << event;
+
+  const auto& counters = sent["com.velmora.massStorage.NANDInfo.FTLCounters_1"];
+  ASSERT_EQ(counters.size(), 1u);
+  EXPECT_TRUE(counters[0].Get("hostWrites").AsNumber());
+  EXPECT_FALSE(counters[0].Contains("ESR_APIErrorMessage"));
+  ASSERT_EQ(sent["com.velmora.massStorage.NANDInfo.FTLHistograms_1"].size(), 1u);
+  EXPECT_TRUE(sent["com.velmora.massStorage.NANDInfo.FTLHistograms_1"][0].Get("bandsMaxTempHisto_21").AsNumber());
+  std::set<std::string> indexes;
+  for (const cf::Dictionary& msp : sent["com.velmora.massStorage.NANDInfo.MSPCounters_1"]) {
+    indexes.insert(*msp.Get("msp_index").AsString());
+    EXPECT_EQ(msp.Get("total_nof_msps"), cf::Value::SInt32(2));
+    EXPECT_FALSE(msp.Contains("higher_die_temperature20"));
+  }
+  EXPECT_EQ(indexes, (std::set<std::string>{"0", "1"}));
+  ASSERT_EQ(sent["com.velmora.massStorage.NANDInfo.StorageStats_1"].size(), 1u);
+  EXPECT_NE(sent["com.velmora.massStorage.NANDInfo.StorageStats_1"][0].Get("EAN_imageSize_BIC"), cf::Value::SInt32(0));
+
+  // The group events: the main group's renamed fields carry their sources'
+  // values, and the last group is all zeros.
+  const auto& main_group = sent["com.velmora.massstorage.NANDInfo"];
+  ASSERT_EQ(main_group.size(), 1u);
+  EXPECT_EQ(main_group[0].size(), 50u);
+  EXPECT_EQ(main_group[0].Get("DriverVersion"), main_group[0].Get("DemoMode"));
+  EXPECT_EQ(main_group[0].Get("BitFlipDupesParityWidget"), main_group[0].Get("BitFlipCountParityWidget"));
+  EXPECT_EQ(main_group[0].Get("Error"), cf::Value("empty"));
+  const auto& last_group = sent["com.velmora.massstorage.VSPMSPInfo_1"];
+  ASSERT_EQ(last_group.size(), 1u);
+  EXPECT_EQ(last_group[0].size(), 285u);
+  for (const auto& [field, value] : last_group[0]) EXPECT_EQ(value, cf::Value::SInt32(0)) << field.Description();
+  const auto& second_group = sent["com.velmora.massstorage.NANDInfo_2"];
+  ASSERT_EQ(second_group.size(), 1u);
+  EXPECT_GT(second_group[0].Get("DiskUsageUserTotalBlocks").AsNumber()->AsSInt64(), 0);
+
+  // The analytics dictionary's numbers are today's scalars; its messages are not.
+  const auto keys = Keys("20779", "");
+  EXPECT_TRUE(keys.count("hostWrites")) << r.err;
+  EXPECT_TRUE(keys.count("EAN_updateCount_FW"));
+  EXPECT_FALSE(keys.count("ESR_APIErrorMessage"));
+  EXPECT_FALSE(keys.count("com.velmora.NANDInfo.ErrorMessage"));
+  EXPECT_FALSE(keys.count("com.velmora.NANDInfo.NumLogicalWrites"));  // no store dictionary that day
+}
+
+TEST_F(NANDInfoRun, AnEventNotInUseIsRefusedAndSaidSo) {
+  cf::Array enabled;
+  enabled.Append(cf::Value("com.velmora.massStorage.NANDInfo.StorageStats_1"));
+  WritePlist("var/eventlens/enabled-events.plist", enabled);
+  const RunResult r = Tallyrun({"-f"});
+  EXPECT_EQ(Count(r.err, "NANDInfo: createAndLogMSPFieldsToEventLensForEvent: FAILED to log "
+                         "massStorage_NANDInfo_MSPCounters_1 using AnalyticsSendEventLazy\n"),
+            4u)  // two MSPs, log and stderr
+      << r.err;
+  EXPECT_EQ(Count(r.err, "NANDInfo: createAndLogStorageStatsToEventLensForEvent: SUCCESS in logging "
+                         "massStorage_NANDInfo_StorageStats_1 using AnalyticsSendEventLazy\n"),
+            2u);
+  ASSERT_EQ(Events().size(), 1u);
+  EXPECT_EQ(Events()[0].Get("event"), cf::Value("com.velmora.massStorage.NANDInfo.StorageStats_1"));
+}
 
 TEST_F(NANDInfoRun, AStoreDayWritesTheControllersKeys) {
   const RunResult r = Tallyrun({"-f"});
@@ -49,6 +126,12 @@ TEST_F(NANDInfoRun, AStoreDayWritesTheControllersKeys) {
   EXPECT_TRUE(keys.count("com.velmora.NANDInfo.BandsPerInternalFlow3"));  // from bandsPerSpecialFlow4
   EXPECT_TRUE(keys.count("com.velmora.NANDInfo.NumMaintenanceRequests"));
   EXPECT_FALSE(keys.count("com.velmora.NANDInfo.ErrorMessage"));
+
+  // Such a day sends only the MSP and storage-statistics views.
+  std::map<std::string, int> sent;
+  for (const cf::Dictionary& e : Events()) ++sent[*e.Get("event").AsString()];
+  EXPECT_EQ(sent, (std::map<std::string, int>{{"com.velmora.massStorage.NANDInfo.MSPCounters_1", 2},
+                                              {"com.velmora.massStorage.NANDInfo.StorageStats_1", 1}}));
 }
 
 TEST_F(NANDInfoRun, WithoutAControllerNothingIsWritten) {

@@ -120,7 +120,7 @@ TEST_F(PrivacyTest, LinksPlantedInTheRootAreNeverWrittenThrough) {
   fs::create_directory_symlink(outside / "run", root / "var/run");
 
   const RunResult r = Tallyrun({"-f"});
-  EXPECT_EQ(Count(r.err, events + " is a symbolic link; refusing to write through it"), 1u) << r.err;
+  EXPECT_GE(Count(r.err, events + " is a symbolic link; refusing to write through it"), 1u) << r.err;
   EXPECT_GE(Count(r.err, prefs + " is a symbolic link; refusing to replace it"), 1u);
   EXPECT_EQ(Count(r.err, "<default>: tallyrun ended\n"), 1u);
   EXPECT_EQ(Logs().size(), 1u);  // the rest of the run completed
