@@ -5,10 +5,16 @@
 #include <cmath>
 #include <cstdio>
 #include <algorithm>
+#include <filesystem>
 #include <limits>
+#include <memory>
+#include <optional>
 #include <string>
+#include <vector>
 
 #include "tools/cli.h"
+#include "tools/line_chart.h"
+#include "tools/output.h"
 #include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
@@ -19,6 +25,8 @@ namespace {
 
 constexpr int kBadInput = 2;
 constexpr int kStoreError = 1;
+constexpr int64_t kDefaultDays = 30;
+constexpr int64_t kMaxDays = 100000;  // beyond any store's age
 
 bool ParseInteger(const std::string& text, int64_t* out) {
   const char* end = text.data() + text.size();
@@ -51,23 +59,37 @@ std::string Real(double d) {
   return buf;
 }
 
-int Dump(bool one_day, int64_t day, const std::string& prefix) {
+std::unique_ptr<platform::TBHistory> OpenHistory() {
   std::string error;
   auto history = platform::TBHistory::initWithDefaultPath(&error);
-  if (!history) {
-    std::fprintf(stderr, "tallybook: %s\n", error.c_str());
-    return kStoreError;
-  }
+  if (!history) std::fprintf(stderr, "tallybook: %s\n", error.c_str());
+  return history;
+}
+
+// The fields every JSON line of a key and day starts with.
+std::string JSONHead(int32_t day, const std::string& key) {
+  return "{\"day\":" + std::to_string(day) + ",\"date\":\"" + tools::IsoDate(day) + "\",\"key\":" +
+         tools::JSONString(key);
+}
+
+std::string JSONReal(double d) { return std::isfinite(d) ? tools::RealText(d) : "null"; }
+
+int Dump(bool one_day, int64_t day, const std::string& prefix, bool json) {
+  auto history = OpenHistory();
+  if (!history) return kStoreError;
   // The history's range excludes its minimum.
   const int32_t lo = one_day ? static_cast<int32_t>(std::max<int64_t>(day - 1, std::numeric_limits<int32_t>::min()))
                              : std::numeric_limits<int32_t>::min();
   const int32_t hi = one_day ? static_cast<int32_t>(day) : std::numeric_limits<int32_t>::max();
-  bool ok = history->scalarsForKeyPrefix(prefix, lo, hi, [](const std::string& key, int32_t d, int64_t v, bool*) {
-    std::printf("%d %s %lld\n", d, key.c_str(), static_cast<long long>(v));
+  bool ok = history->scalarsForKeyPrefix(prefix, lo, hi, [json](const std::string& key, int32_t d, int64_t v, bool*) {
+    if (json)
+      std::printf("%s,\"value\":%lld}\n", JSONHead(d, key).c_str(), static_cast<long long>(v));
+    else
+      std::printf("%d %s %lld\n", d, key.c_str(), static_cast<long long>(v));
   });
   ok = ok && history->distributionsForKeyPrefix(
                  prefix, lo, hi,
-                 [](const std::string& key, int32_t d, platform::TBHistoryDistributionEnumerator& e, bool*) {
+                 [json](const std::string& key, int32_t d, platform::TBHistoryDistributionEnumerator& e, bool*) {
                    double v = 0, mn = 0, mx = 0, mean = 0;
                    int32_t offset = 0;
                    uint64_t n = 0;
@@ -77,11 +99,77 @@ int Dump(bool one_day, int64_t day, const std::string& prefix) {
                      if (n == 1 || v > mx) mx = v;
                      mean += (v - mean) / static_cast<double>(n);
                    }
-                   std::printf("%d %s %llu %s %s %s\n", d, key.c_str(), static_cast<unsigned long long>(n),
-                               Real(mn).c_str(), Real(mx).c_str(), Real(mean).c_str());
+                   if (json)
+                     std::printf("%s,\"count\":%llu,\"min\":%s,\"max\":%s,\"mean\":%s}\n", JSONHead(d, key).c_str(),
+                                 static_cast<unsigned long long>(n), JSONReal(mn).c_str(), JSONReal(mx).c_str(),
+                                 JSONReal(mean).c_str());
+                   else
+                     std::printf("%d %s %llu %s %s %s\n", d, key.c_str(), static_cast<unsigned long long>(n),
+                                 Real(mn).c_str(), Real(mx).c_str(), Real(mean).c_str());
                  });
   if (!ok) {
     std::fprintf(stderr, "tallybook: the store could not be read\n");
+    return kStoreError;
+  }
+  return 0;
+}
+
+// The values of one scalar key in the last `days` days up to today, by day.
+// Nothing, after a message, when the key has none there (exit 2) or the
+// store cannot be read (exit 1); the status goes to *status.
+std::optional<std::vector<tools::DayValue>> ScalarHistory(const std::string& key, int64_t days, int* status) {
+  auto history = OpenHistory();
+  *status = kStoreError;
+  if (!history) return std::nullopt;
+  const int32_t today = TBDaysSince1970();
+  const int32_t after = static_cast<int32_t>(today - days);
+  std::vector<tools::DayValue> points;
+  bool ok = history->scalarsForKeyPrefix(key, after, today, [&](const std::string& k, int32_t d, int64_t v, bool*) {
+    if (k == key) points.push_back({d, v});
+  });
+  if (ok && !points.empty()) return points;
+  bool distribution = false;
+  ok = ok && history->distributionsForKeyPrefix(
+                 key, std::numeric_limits<int32_t>::min(), std::numeric_limits<int32_t>::max(),
+                 [&](const std::string& k, int32_t, platform::TBHistoryDistributionEnumerator&, bool* stop) {
+                   if (k == key) distribution = *stop = true;
+                 });
+  if (!ok) {
+    std::fprintf(stderr, "tallybook: the store could not be read\n");
+    return std::nullopt;
+  }
+  *status = kBadInput;
+  if (distribution)
+    BadInput(key + " is a distribution key; history and plot show scalar keys (see dump for its samples)");
+  else
+    BadInput("no values of the scalar key " + key + " in the last " + std::to_string(days) +
+             (days == 1 ? " day" : " days") + " (" + tools::IsoDate(after + 1) + " to " + tools::IsoDate(today) + ")");
+  return std::nullopt;
+}
+
+int History(const std::string& key, int64_t days, bool json) {
+  int status = 0;
+  const auto points = ScalarHistory(key, days, &status);
+  if (!points) return status;
+  for (const tools::DayValue& p : *points) {
+    if (json)
+      std::printf("%s,\"value\":%lld}\n", JSONHead(p.day, key).c_str(), static_cast<long long>(p.value));
+    else
+      std::printf("%d %s %lld\n", p.day, tools::IsoDate(p.day).c_str(), static_cast<long long>(p.value));
+  }
+  return 0;
+}
+
+int Plot(const std::string& key, int64_t days, const std::string& out) {
+  int status = 0;
+  const auto points = ScalarHistory(key, days, &status);
+  if (!points) return status;
+  std::string error;
+  // Absolute, so that a chart written below the device root gets the same
+  // refusal of links as everything else there.
+  const std::string path = std::filesystem::absolute(out).lexically_normal().string();
+  if (!platform::WriteFileAtomically(path, tools::LineChartSVG(key, *points), &error)) {
+    std::fprintf(stderr, "tallybook: %s\n", error.c_str());
     return kStoreError;
   }
   return 0;
@@ -110,6 +198,18 @@ int main(int argc, char** argv) {
                                           "'day key count min max mean'");
   auto* day_opt = dump->add_option("--day", day, "only this day number");
   dump->add_option("--prefix", prefix, "only keys starting with this");
+  bool json = false;
+  dump->add_flag("--json", json, "one JSON object per line, with the day's date");
+  int64_t days = kDefaultDays;
+  std::string out;
+  auto* history = app.add_subcommand("history", "Print a scalar key's values over the last days as 'day date value'");
+  history->add_option("KEY", key)->required();
+  history->add_option("--days", days, "how many days up to today (default 30)");
+  history->add_flag("--json", json, "one JSON object per line");
+  auto* plot = app.add_subcommand("plot", "Draw a scalar key's values over the last days as an SVG line chart");
+  plot->add_option("KEY", key)->required();
+  plot->add_option("--days", days, "how many days up to today (default 30)");
+  plot->add_option("--out", out, "the SVG file to write")->required();
   auto* today = app.add_subcommand("today", "Print today's day number");
 
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
@@ -122,7 +222,18 @@ int main(int argc, char** argv) {
   if (dump->parsed()) {
     if (day_opt->count() && (day < std::numeric_limits<int32_t>::min() || day > std::numeric_limits<int32_t>::max()))
       return BadInput("day number out of range: " + std::to_string(day));
-    return Dump(day_opt->count() > 0, day, prefix);
+    return Dump(day_opt->count() > 0, day, prefix, json);
+  }
+  if (history->parsed() || plot->parsed()) {
+    if (key.empty()) return BadInput("key must not be empty");
+    if (days < 1 || days > kMaxDays)
+      return BadInput("--days must be a whole number of days from 1 to " + std::to_string(kMaxDays) + ": " +
+                      std::to_string(days));
+    if (history->parsed()) return History(key, days, json);
+    // The key is the chart's title: the file must be able to carry it.
+    if (std::string why; !cf::IsPropertyListString(key, &why)) return BadInput("key cannot be a chart's title: " + why);
+    if (out.empty() || out.back() == '/') return BadInput("--out must name a file: \"" + out + "\"");
+    return Plot(key, days, out);
   }
 
   // Writes: every argument is checked before the store is opened, so bad

@@ -1,6 +1,8 @@
-// tallyctl: sends one message to the tallyrun service of TALLYRUN_ROOT.
+// tallyctl: sends one message to the tallyrun service of TALLYRUN_ROOT, or
+// shows a submitted log.
 
 #include <cstdio>
+#include <filesystem>
 #include <limits>
 #include <string>
 
@@ -8,6 +10,7 @@
 #include "tools/cli.h"
 #include "platform/files.h"
 #include "platform/service.h"
+#include "tools/output.h"
 
 namespace {
 
@@ -70,6 +73,23 @@ bool ReadAppData(const std::string& file, cf::Array* out, std::string* error) {
   return true;
 }
 
+// A property list (a submitted log, a preference file) as indented JSON.
+int Show(const std::string& file) {
+  std::error_code ec;
+  // A pipe or a device would never end, or never begin.
+  if (!std::filesystem::is_regular_file(file, ec)) {
+    const bool exists = std::filesystem::exists(file, ec);
+    return Fail(2, exists ? file + " is not a regular file" : "no file " + file);
+  }
+  std::string error;
+  const auto bytes = platform::ReadFile(file, &error);
+  if (!bytes) return Fail(2, error);
+  const cf::ParseResult parsed = cf::ParsePropertyList(*bytes);
+  if (!parsed.ok()) return Fail(2, file + " is not a property list: " + parsed.error);
+  std::printf("%s\n", tools::JSONText(parsed.value, 2).c_str());
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -85,7 +105,10 @@ int main(int argc, char** argv) {
   auto* send = app.add_subcommand("send", "Send any operation code");
   send->add_option("OPERATION", operation)->required();
   auto* value_opt = send->add_option("--value", value, "the message's \"value\"");
+  auto* show = app.add_subcommand("show", "Print a submitted log (a property list) as JSON");
+  show->add_option("FILE", file)->required();
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
+  if (show->parsed()) return Show(file);
   if (const auto status = CheckDeviceRoot("tallyctl")) return *status;
 
   cf::Dictionary message;
