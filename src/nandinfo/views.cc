@@ -275,9 +275,10 @@ void SendReferenceMapGroupEvents(const cf::Value& tbkd, int64_t freezerBytes, in
   const cf::Dictionary* map = parsed.value.AsDictionary();
   if (!map) return;
   for (std::string_view name : nandinfo::EventLensEvents()) {
+    // A group the map lacks still goes out, with its special fields only.
     const cf::Dictionary* group = map->Get(cf::Value(name)).AsDictionary();
-    if (!group) continue;
-    AnalyticsSendEventLazy(name, [name, g = *group, tbkd_copy = *t, freezerBytes, capacityMB, freeMB] {
+    AnalyticsSendEventLazy(name, [name, g = group ? *group : cf::Dictionary(), tbkd_copy = *t, freezerBytes, capacityMB,
+                                  freeMB] {
       return cf::Value(BuildGroupEventPayload(name, g, tbkd_copy, freezerBytes, capacityMB, freeMB));
     });
   }

@@ -1,5 +1,6 @@
 #include "platform/clock.h"
 
+#include <cerrno>
 #include <cmath>
 #include <cstdio>
 #include <cstdlib>
@@ -117,7 +118,10 @@ SystemClock::SystemClock() {
   const char* env = std::getenv("TALLYRUN_NOW");
   if (env && *env) {
     fixed_ = ParseInstant(env);
-    if (!fixed_) std::fprintf(stderr, "tallyrun: ignoring TALLYRUN_NOW=\"%s\": not epoch seconds or an ISO-8601 date-time\n", env);
+    // Under the name of the program that reads it: each tool speaks for itself.
+    if (!fixed_)
+      std::fprintf(stderr, "%s: ignoring TALLYRUN_NOW=\"%s\": not epoch seconds or an ISO-8601 date-time\n",
+                   program_invocation_short_name, env);
   }
 }
 

@@ -7,13 +7,14 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <charconv>
 #include <cstdio>
 #include <cstring>
 #include <optional>
 #include <string>
 
+#include "platform/clock.h"
 #include "platform/context.h"
-
 #include "platform/files.h"
 
 // Nothing when the program should go on; otherwise its exit status (0 after
@@ -21,6 +22,22 @@
 // Every tool creates what it creates under the root privately.
 inline std::optional<int> ParseCommandLine(CLI::App& app, int argc, char** argv) {
   platform::ApplyPrivateUmask();
+  // A first word that names no subcommand is named back, with the valid
+  // ones (the parser would only say that one is required).
+  if (argc > 1 && argv[1][0] != '-' && !app.get_subcommands({}).empty()) {
+    std::string valid;
+    bool known = false;
+    for (const CLI::App* sub : app.get_subcommands({})) {
+      known = known || sub->get_name() == argv[1];
+      valid += (valid.empty() ? "" : ", ") + sub->get_name();
+    }
+    if (!known) {
+      const char* slash = std::strrchr(argv[0], '/');
+      std::fprintf(stderr, "%s: unknown subcommand '%s'; the subcommands are: %s (--help for more)\n",
+                   slash ? slash + 1 : argv[0], argv[1], valid.c_str());
+      return 2;
+    }
+  }
   try {
     app.parse(argc, argv);
   } catch (const CLI::CallForHelp& e) {
@@ -58,5 +75,28 @@ inline std::optional<int> CheckDeviceRoot(const char* tool) {
     const int cause = errno;
     return fail("cannot read the device root " + root + ": " + std::strerror(cause));
   }
+  return std::nullopt;
+}
+
+// A day as the tools take it: a day number (whole local days since
+// 1970-01-01) or an ISO date (YYYY-MM-DD). Nothing, with the reason in
+// *error, for anything else.
+inline std::optional<int64_t> ParseDay(const std::string& text, std::string* error) {
+  int64_t day = 0;
+  const char* end = text.data() + text.size();
+  if (auto [ptr, ec] = std::from_chars(text.data(), end, day); ec == std::errc() && ptr == end && !text.empty())
+    return day;
+  int year = 0;
+  unsigned month = 0, mday = 0;
+  char tail = 0;
+  if (text.size() == 10 && text[4] == '-' && text[7] == '-' &&
+      std::sscanf(text.c_str(), "%4d-%2u-%2u%c", &year, &month, &mday, &tail) == 3 && month >= 1 && month <= 12 &&
+      mday >= 1) {
+    const int64_t first = platform::DaysFromCivil(year, month, 1);
+    const int64_t next = month == 12 ? platform::DaysFromCivil(year + 1, 1, 1) : platform::DaysFromCivil(year, month + 1, 1);
+    if (mday <= next - first) return first + mday - 1;
+  }
+  *error = "expected a day number or an ISO date (YYYY-MM-DD), not '" + text +
+           "'; `tallybook today` prints today's day number";
   return std::nullopt;
 }

@@ -71,6 +71,19 @@ int Snapshot(const std::string& file, const std::string& header_file) {
     std::fwrite(out.data(), 1, result ? size : std::strlen(out.data()), stdout);
     return result ? 0 : 1;
   }
+  // A header that describes no record would print nothing at all: say so.
+  {
+    std::vector<char> probe(std::max<size_t>(65536, header.size() + 4096));
+    uint32_t size = static_cast<uint32_t>(probe.size()), index = 0;
+    const int result = VSPParseSnapshotBufferWithInplaceParser(data.data(), static_cast<uint32_t>(data.size()),
+                                                               probe.data(), &size, header.data(),
+                                                               static_cast<uint32_t>(header.size()), &index);
+    if (result && size <= 1) {
+      std::fprintf(stderr, "devsim: the snapshot header %s (%zu bytes) describes no records; nothing to print\n",
+                   header_file.c_str(), header.size());
+      return kBadInput;
+    }
+  }
   // Piece by piece, as a caller with a fixed buffer would. The parser passes
   // over a record that does not fit, so the next piece starts again at that
   // record; when not even the first record of a piece (or the preamble)
@@ -97,6 +110,34 @@ int Snapshot(const std::string& file, const std::string& header_file) {
     }
     out.resize(out.size() * 2);
   }
+}
+
+// --force: a root made again keeps nothing of the old one (not its store,
+// gate record, submissions or logs), so it is the root a fresh init gives.
+// Only a directory that holds a device root is emptied; each entry removed
+// is named. False, after a message, when DIR is something else.
+bool ClearOldRoot(const std::string& dir) {
+  namespace fs = std::filesystem;
+  std::error_code ec;
+  if (!fs::exists(dir, ec) || fs::is_empty(dir, ec)) return true;
+  if (!fs::is_directory(fs::path(dir) / "device", ec) && !fs::is_directory(fs::path(dir) / "var", ec)) {
+    std::fprintf(stderr, "devsim: %s is not empty and holds no device root (no device/ or var/); not removing anything\n",
+                 dir.c_str());
+    return false;
+  }
+  std::vector<fs::path> entries;
+  for (const auto& e : fs::directory_iterator(dir, ec)) entries.push_back(e.path());
+  std::sort(entries.begin(), entries.end());
+  for (const fs::path& entry : entries) {
+    // remove_all does not follow links: a link's target stays untouched.
+    fs::remove_all(entry, ec);
+    if (ec) {
+      std::fprintf(stderr, "devsim: cannot remove %s: %s\n", entry.c_str(), ec.message().c_str());
+      return false;
+    }
+    std::fprintf(stderr, "devsim: removed %s\n", entry.c_str());
+  }
+  return true;
 }
 
 // The support library built beside devsim; found from devsim's own place
@@ -265,7 +306,7 @@ int main(int argc, char** argv) {
   bool force = false;
   auto* init = app.add_subcommand("init", "Write a complete default device root into DIR");
   init->add_option("DIR", dir)->required();
-  init->add_flag("--force", force, "write into a non-empty DIR, replacing the files it writes");
+  init->add_flag("--force", force, "replace the device root already in DIR: everything in it is removed first");
   std::string kind, file, header_file;
   auto* parse = app.add_subcommand("parse", "Parse a raw statistics buffer: one 'name value' line per pair");
   parse->add_option("KIND", kind, "ftl, stats or msp")->required()->check(CLI::IsMember({"ftl", "stats", "msp"}));
@@ -306,9 +347,10 @@ int main(int argc, char** argv) {
       return 2;
     }
     if (!force && std::filesystem::exists(dir, ec) && !std::filesystem::is_empty(dir, ec)) {
-      std::fprintf(stderr, "devsim: %s is not empty (use --force to write into it)\n", dir.c_str());
+      std::fprintf(stderr, "devsim: %s is not empty (use --force to replace the device root in it)\n", dir.c_str());
       return 2;
     }
+    if (force && !ClearOldRoot(dir)) return 2;
     std::string error;
     if (!WriteDefaultRoot(std::filesystem::absolute(dir).string(), SupportLibrary(), &error)) {
       std::fprintf(stderr, "devsim: %s\n", error.c_str());

@@ -53,11 +53,6 @@ platform::TallyStore* OpenStore() {
   return store;
 }
 
-std::string Real(double d) {
-  char buf[64];
-  std::snprintf(buf, sizeof buf, "%0.16g", d);
-  return buf;
-}
 
 std::unique_ptr<platform::TBHistory> OpenHistory() {
   std::string error;
@@ -105,7 +100,8 @@ int Dump(bool one_day, int64_t day, const std::string& prefix, bool json) {
                                  JSONReal(mean).c_str());
                    else
                      std::printf("%d %s %llu %s %s %s\n", d, key.c_str(), static_cast<unsigned long long>(n),
-                                 Real(mn).c_str(), Real(mx).c_str(), Real(mean).c_str());
+                                 tools::RealText(mn).c_str(), tools::RealText(mx).c_str(),
+                                 tools::RealText(mean).c_str());
                  });
   if (!ok) {
     std::fprintf(stderr, "tallybook: the store could not be read\n");
@@ -196,7 +192,8 @@ int main(int argc, char** argv) {
   auto* offset_opt = push->add_option("--offset", offset, "seconds within the day (default: now)");
   auto* dump = app.add_subcommand("dump", "Print scalars as 'day key value', distributions as "
                                           "'day key count min max mean'");
-  auto* day_opt = dump->add_option("--day", day, "only this day number");
+  std::string day_text;
+  auto* day_opt = dump->add_option("--day", day_text, "only this day: a day number or an ISO date (YYYY-MM-DD)");
   dump->add_option("--prefix", prefix, "only keys starting with this");
   bool json = false;
   dump->add_flag("--json", json, "one JSON object per line, with the day's date");
@@ -220,6 +217,12 @@ int main(int argc, char** argv) {
   }
   if (const auto status = CheckDeviceRoot("tallybook")) return *status;
   if (dump->parsed()) {
+    if (day_opt->count()) {
+      std::string error;
+      const auto parsed = ParseDay(day_text, &error);
+      if (!parsed) return BadInput(error);
+      day = *parsed;
+    }
     if (day_opt->count() && (day < std::numeric_limits<int32_t>::min() || day > std::numeric_limits<int32_t>::max()))
       return BadInput("day number out of range: " + std::to_string(day));
     return Dump(day_opt->count() > 0, day, prefix, json);

@@ -95,11 +95,11 @@ int Show(const std::string& file) {
 int main(int argc, char** argv) {
   CLI::App app{"Send one message to the tallyrun service of TALLYRUN_ROOT"};
   app.require_subcommand(1);
-  int64_t day = 0, operation = 0, value = 0;
-  std::string file;
+  int64_t operation = 0, value = 0;
+  std::string file, day_text;
   auto* logging = app.add_subcommand("logging-status", "Announce that app information will follow (operation 0)");
   auto* run_day = app.add_subcommand("run-day", "Run the daily tasks for a day (operation 1)");
-  run_day->add_option("DAY", day, "day number")->required();
+  run_day->add_option("DAY", day_text, "a day number or an ISO date (YYYY-MM-DD)")->required();
   auto* app_data = app.add_subcommand("app-data", "Deliver activated-app information from a JSON file (operation 2)");
   app_data->add_option("FILE", file)->required();
   auto* send = app.add_subcommand("send", "Send any operation code");
@@ -109,6 +109,14 @@ int main(int argc, char** argv) {
   show->add_option("FILE", file)->required();
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
   if (show->parsed()) return Show(file);
+  int64_t day = 0;
+  if (run_day->parsed()) {
+    std::string error;
+    const auto parsed = ParseDay(day_text, &error);
+    if (!parsed) return Fail(2, error);
+    if (*parsed < 0) return Fail(2, "a day before 1970-01-01 cannot be run: " + day_text);
+    day = *parsed;
+  }
   if (const auto status = CheckDeviceRoot("tallyctl")) return *status;
 
   cf::Dictionary message;
