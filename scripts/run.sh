@@ -20,3 +20,9 @@ if [ -n "$newest" ] && [ "$after" -gt "$before" ]; then
 else
   echo "no aggregated log was written (nothing whitelisted for yesterday, or submission is off)"
 fi
+cat <<EOF
+
+To use the tools on this root from your shell, paste:
+  export TALLYRUN_ROOT="$TALLYRUN_ROOT"
+  export PATH="$PWD/build/src/tools:$PWD/build/src/driver:\$PATH"
+EOF
