@@ -178,6 +178,11 @@ int Controller(const std::string& root) {
 // the health, lab and OTA views and the content-deletion answer.
 int Views(const std::string& root, bool round) {
   platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  // The service prints some progress lines on standard output; while the
+  // views are gathered they go to standard error, so the output is JSON.
+  std::fflush(stdout);
+  const int saved_stdout = dup(STDOUT_FILENO);
+  dup2(STDERR_FILENO, STDOUT_FILENO);
   cf::Dictionary views;
   views.Set("FTL", CopyWhitelistedNANDFTLInfo(round));
   views.Set("MSP", CopyWhitelistedNANDMSPInfo(round));
@@ -186,6 +191,9 @@ int Views(const std::string& root, bool round) {
   views.Set("InternalLab", CopyInternalLabNANDInfo());
   views.Set("OTA", CopyOTANANDInfo());
   views.Set("ContentDeletion", NandRecommendsContentDeletion());
+  std::fflush(stdout);
+  dup2(saved_stdout, STDOUT_FILENO);
+  close(saved_stdout);
   std::string json, error;
   if (!cf::WriteJSON(views, json, &error, 2)) {
     std::fprintf(stderr, "devsim: %s\n", error.c_str());

@@ -157,6 +157,25 @@ TEST_F(NANDInfoRun, DevsimShowsTheControllerOfARoot) {
   EXPECT_EQ(json.AsDictionary()->Get("com.velmora.NANDInfo.VMFreezer.NumPhysicalWrites").AsNumber()->AsSInt64(),
             2147483648);
 
+  // Every view, as JSON on standard output even though the service prints
+  // progress lines; rounding only on request.
+  for (const bool round : {false, true}) {
+    std::vector<std::string> args = {"views", root.path()};
+    if (round) args.push_back("--round");
+    const RunResult views = RunProgram(DEVSIM_BIN, args, env);
+    ASSERT_EQ(views.status, 0) << views.err;
+    const cf::Value v = cf::ParseJSON(views.out).value;
+    ASSERT_NE(v.AsDictionary(), nullptr) << views.out;
+    const cf::Dictionary& d = *v.AsDictionary();
+    EXPECT_EQ(d.Get("FTL").AsDictionary()->Get("hostWrites").AsNumber()->AsSInt64(), round ? 1843261400 : 1843261440);
+    EXPECT_TRUE(d.Get("MSP").AsDictionary()->Get("1").AsDictionary());
+    EXPECT_EQ(d.Get("StorageStats").AsDictionary()->Get("EAN_updateCount_dConfig").AsNumber()->AsSInt64(), 27);
+    EXPECT_EQ(d.Get("InternalLab").AsDictionary()->Get("com.velmora.NANDInfo.Health.IsNANDRetirable"),
+              cf::Value::SInt32(1));
+    EXPECT_FALSE(d.Get("OTA").AsDictionary()->Contains("ESR_APIErrorMessage"));
+    EXPECT_EQ(d.Get("ContentDeletion"), cf::Value::Bool(false));  // not the controller kind that answers it
+  }
+
   WritePlist("device/registry.plist", cf::Array());
   const RunResult none = RunProgram(DEVSIM_BIN, {"controller", root.path()}, env);
   EXPECT_EQ(none.status, 1);
