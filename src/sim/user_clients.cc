@@ -1,6 +1,9 @@
 #include "sim/user_clients.h"
 
+#include <mutex>
+#include <string>
 #include <string_view>
+#include <vector>
 
 namespace sim {
 
@@ -17,12 +20,44 @@ constexpr Kind kKinds[] = {
     {"hub", &CreateHubClient},
 };
 
+// Kinds registered from behind the seam; registration happens once, but a
+// lookup may come from any thread that has a context.
+struct Registered {
+  std::string name;
+  UserClientFactory create;
+  ServiceAttacher attach;
+};
+std::mutex g_registered_mu;
+std::vector<Registered>& RegisteredKinds() {
+  static std::vector<Registered> kinds;
+  return kinds;
+}
+
+const Registered* FindRegistered(std::string_view name) {
+  std::lock_guard<std::mutex> lock(g_registered_mu);
+  for (const Registered& kind : RegisteredKinds())
+    if (kind.name == name) return &kind;
+  return nullptr;
+}
+
 }  // namespace
 
 std::unique_ptr<UserClient> CreateUserClient(const Service& service, DeviceFiles& files) {
   for (const Kind& kind : kKinds)
     if (kind.name == service.user_client) return kind.create(service, files);
+  if (const Registered* kind = FindRegistered(service.user_client)) return kind->create(service, files);
   return nullptr;
+}
+
+void RegisterUserClientKind(std::string_view name, UserClientFactory create, ServiceAttacher attach) {
+  if (FindRegistered(name)) return;
+  std::lock_guard<std::mutex> lock(g_registered_mu);
+  RegisteredKinds().push_back({std::string(name), create, attach});
+}
+
+ServiceAttacher AttacherOf(std::string_view kind) {
+  const Registered* r = FindRegistered(kind);
+  return r ? r->attach : nullptr;
 }
 
 }  // namespace sim
