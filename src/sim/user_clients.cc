@@ -1,9 +1,9 @@
 #include "sim/user_clients.h"
 
+#include <deque>
 #include <mutex>
 #include <string>
 #include <string_view>
-#include <vector>
 
 namespace sim {
 
@@ -21,15 +21,16 @@ constexpr Kind kKinds[] = {
 };
 
 // Kinds registered from behind the seam; registration happens once, but a
-// lookup may come from any thread that has a context.
+// lookup may come from any thread that has a context. A deque keeps the
+// records where they are while more are added.
 struct Registered {
   std::string name;
   UserClientFactory create;
   ServiceAttacher attach;
 };
 std::mutex g_registered_mu;
-std::vector<Registered>& RegisteredKinds() {
-  static std::vector<Registered> kinds;
+std::deque<Registered>& RegisteredKinds() {
+  static std::deque<Registered> kinds;
   return kinds;
 }
 
