@@ -285,5 +285,36 @@ int main(int argc, char** argv) {
   Seed("ioreport_raw", "count-overflows", element(0x10, 1, type(1, 1), {1}) + element(0x10, 2, type(2, 0xFFFF), {1}) +
                                               raw.substr(64, 3 * 64));
   Seed("ioreport_raw", "cut-mid-record", raw.substr(0, 64 * 5 + 24));
+
+  // Health pages laid out as the controller writes them: counters are
+  // 16-byte little-endian numbers.
+  auto counter = [](std::string& page, size_t at, uint64_t low, uint64_t high) {
+    for (int i = 0; i < 8; ++i) {
+      page[at + i] = static_cast<char>(low >> (8 * i));
+      page[at + 8 + i] = static_cast<char>(high >> (8 * i));
+    }
+  };
+  std::string health(512, '\0');
+  health[0] = 0x02, health[1] = 0x2C, health[2] = 0x01, health[3] = 100, health[4] = 10, health[5] = 3;
+  for (size_t at = 32; at <= 176; at += 16) counter(health, at, at * 1000, 0);
+  Seed("health_page", "healthy", health);
+  std::string saturated = health;
+  counter(saturated, 48, 5, 1);
+  counter(saturated, 32, UINT64_MAX, 0);
+  Seed("health_page", "saturated", saturated);
+  Seed("health_page", "short", health.substr(0, 511));
+  std::string identify(4096, ' ');
+  identify.replace(4, 6, "SN0001").replace(24, 10, "Disk Model").replace(64, 4, "1.0A");
+  identify.replace(280, 16, std::string("\0\0\0\0\x74\0\0\0\0\0\0\0\0\0\0\0", 16));
+  Seed("health_page", "identify", identify);
+
+  Seed("block_stat", "seventeen-fields",
+       "  503119    19226 14209554   282923  1402809    93775 212010024   708508        0   341220  1218110   417972"
+       "       43 170862800   126164   323660   100514\n");
+  Seed("block_stat", "eleven-fields", "1 2 3 4 5 6 7 8 9 10 11\n");
+  Seed("block_stat", "fifteen-fields", "1 2 3 4 5 6 7 8 9 10 11 12 13 14 15");
+  Seed("block_stat", "too-few", "1 2 3 4 5 6 7 8 9 10");
+  Seed("block_stat", "overflow", "0 0 18446744073709551616 0 0 0 0 0 0 0 0");
+  Seed("block_stat", "junk", "1 2 3 4 5 6 x 8 9 10 11");
   return 0;
 }

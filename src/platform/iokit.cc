@@ -7,6 +7,7 @@
 
 #include "platform/context.h"
 #include "platform/device_model.h"
+#include "platform/host_disk.h"
 #include "platform/log.h"
 #include "platform/profile.h"
 
@@ -52,7 +53,7 @@ const sim::Service* EntryOf(io_registry_entry_t entry) {
 
 }  // namespace
 
-DeviceModel::DeviceModel() : files_(std::make_unique<RootDeviceFiles>()) {}
+DeviceModel::DeviceModel() : files_(std::make_unique<RootDeviceFiles>()) { RegisterHostDiskKind(); }
 DeviceModel::~DeviceModel() = default;
 
 const sim::Registry& DeviceModel::registry() {
@@ -61,6 +62,8 @@ const sim::Registry& DeviceModel::registry() {
     std::string error;
     registry_ = sim::Registry::Load(ReadProfileValue(kRegistryFile), &error);
     if (!error.empty()) LogError("%s: %s; the device has no services", Context::Current().Path(kRegistryFile), error);
+    for (const std::string& left_out : registry_.AttachDevices())
+      LogError("%s: service %s", Context::Current().Path(kRegistryFile), left_out);
     stamp_ = stamp;
     loaded_ = true;
     ++generation_;

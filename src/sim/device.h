@@ -59,6 +59,10 @@ class Registry {
   // The property of the service, or, when recursive, of the nearest parent
   // that has it.
   cf::Value Property(uint64_t id, std::string_view key, bool recursive) const;
+  // Lets each service whose kind registered an attach step complete itself
+  // from its device (see RegisterUserClientKind); a service whose device is
+  // absent leaves the registry. One line per service left out, saying why.
+  std::vector<std::string> AttachDevices();
 
  private:
   std::vector<Service> services_;
@@ -104,5 +108,14 @@ class UserClient {
 // The user client of the service's kind, or null when the kind is unknown
 // (the open then fails). Each kind registers itself in user_clients.cc.
 std::unique_ptr<UserClient> CreateUserClient(const Service& service, DeviceFiles& files);
+
+// Kinds that answer from the real machine live behind the platform seam and
+// register here, once, before the registry is used. attach (may be null)
+// runs when the registry loads: it adds the properties the device reports
+// to the service, or returns false with the reason in *why when the device
+// cannot be read, and the service is then left out as if it were absent.
+using UserClientFactory = std::unique_ptr<UserClient> (*)(const Service&, DeviceFiles&);
+using ServiceAttacher = bool (*)(Service& service, std::string* why);
+void RegisterUserClientKind(std::string_view name, UserClientFactory create, ServiceAttacher attach);
 
 }  // namespace sim

@@ -1,6 +1,7 @@
 #include <set>
 
 #include "sim/device.h"
+#include "sim/user_clients.h"
 
 namespace sim {
 
@@ -118,6 +119,22 @@ cf::Value Registry::Property(uint64_t id, std::string_view key, bool recursive) 
     id = *s->parent;
   }
   return {};
+}
+
+std::vector<std::string> Registry::AttachDevices() {
+  std::vector<std::string> left_out;
+  std::vector<Service> kept;
+  for (Service& s : services_) {
+    const ServiceAttacher attach = s.user_client.empty() ? nullptr : AttacherOf(s.user_client);
+    std::string why;
+    if (attach && !attach(s, &why)) {
+      left_out.push_back(s.name + ": " + why);
+      continue;
+    }
+    kept.push_back(std::move(s));
+  }
+  services_ = std::move(kept);
+  return left_out;
 }
 
 }  // namespace sim

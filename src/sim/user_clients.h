@@ -11,4 +11,7 @@ std::unique_ptr<UserClient> CreateNvmeClient(const Service& service, DeviceFiles
 std::unique_ptr<UserClient> CreateHubClient(const Service& service, DeviceFiles& files);
 std::unique_ptr<UserClient> CreateEanClient(const Service& service, DeviceFiles& files);
 
+// The attach step a registered kind gave, or null.
+ServiceAttacher AttacherOf(std::string_view kind);
+
 }  // namespace sim

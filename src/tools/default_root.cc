@@ -12,6 +12,7 @@
 #include "platform/context.h"
 #include "platform/faultkeep.h"
 #include "platform/files.h"
+#include "platform/host_disk.h"
 #include "platform/store.h"
 #include "platform/usage.h"
 #include "sim/default_device.h"
@@ -218,20 +219,78 @@ bool FillDay(platform::TallyStore& store, int32_t day, double fraction_of_day) {
   });
 }
 
-}  // namespace
-
-bool WriteDefaultRoot(const std::string& root, const std::string& support_library, std::string* error) {
-  platform::ContextScope scope(root);
-  platform::Context& c = scope.context();
+// The whitelist, the answers (with a made-up hardware model unless the
+// machine's own is wanted) and the enabled analytics events.
+bool WriteCommonFiles(platform::Context& c, bool host, std::string* error) {
   if (!WritePlist(c.Path("/Library/Application Support/Tallybook/Whitelist_boxOS.plist"), Whitelist(), error))
     return false;
   cf::Dictionary answers;
   answers.Set("DiagnosticLogSubmissionEnabled", cf::Value::Bool(true));
   answers.Set("InternalBuild", cf::Value::Bool(false));
-  answers.Set("HardwareModel", "BX12,3");
+  if (!host) answers.Set("HardwareModel", "BX12,3");
   answers.Set("InverseDeviceID", "5d0c4e1a9b7f42e8a3c61f0b8e2d7a94");
   answers.Set("SystemLanguages", cf::Array({cf::Value("en"), cf::Value("de"), cf::Value("fr"), cf::Value("ja")}));
-  if (!WritePlist(c.Path("/device/answers.plist"), answers, error)) return false;
+  return WritePlist(c.Path("/device/answers.plist"), answers, error) &&
+         WritePlist(c.Path("/var/eventlens/enabled-events.plist"), EnabledEvents(), error);
+}
+
+// The support library and a fresh store: yesterday in full, today up to the
+// clock's time of day.
+bool WriteLibraryAndStore(platform::Context& c, const std::string& support_library, std::string* error) {
+  const auto library = platform::ReadFile(support_library, error);
+  if (!library || !platform::WriteFileAtomically(c.Path(kFaultkeepSupportPath), *library, error, 0755)) return false;
+  const std::string store_path = c.Path(platform::kStoreDevicePath);
+  for (const char* suffix : {"", "-wal", "-shm"}) unlink((store_path + suffix).c_str());
+  auto store = platform::TallyStore::Open(store_path, platform::TallyStore::Mode::kCreate, error);
+  if (!store) return false;
+  const int32_t today = TBDaysSince1970();
+  const double fraction = std::clamp((platform::Now() - platform::StartOfDay(today)) / 86400.0, 0.05, 1.0);
+  if (!FillDay(*store, today - 1, 1.0) || !FillDay(*store, today, fraction) || !store->Checkpoint()) {
+    if (error) *error = store->last_error();
+    return false;
+  }
+  return true;
+}
+
+cf::Dictionary Entry(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
+  cf::Dictionary d;
+  for (const auto& [k, v] : entries) d.Set(k, v);
+  return d;
+}
+
+}  // namespace
+
+bool WriteHostRoot(const std::string& root, const std::string& support_library, std::vector<std::string>* disks,
+                   std::string* error) {
+  platform::ContextScope scope(root);
+  platform::Context& c = scope.context();
+  if (!WriteCommonFiles(c, true, error)) return false;
+  // Any files of an earlier default root there would put simulated parts
+  // back beside the disks.
+  for (const char* name : {"controller.plist", "stackshot.plist", "purgeable.plist", "ecc-events.plist",
+                           "ioreport.plist", "sysctl.plist", "system-version.plist", "apps.plist", "usage.plist"})
+    unlink(c.Path(std::string("/device/") + name).c_str());
+  *disks = platform::ListHostDisks(root);
+  constexpr uint64_t kPlatformId = 0x100000100;
+  cf::Array registry({Entry({{"class", "IOPlatformExpertDevice"}, {"name", "device-tree"},
+                             {"id", cf::Value::UInt64(kPlatformId)}})});
+  for (size_t i = 0; i < disks->size(); ++i) {
+    const std::string& device = (*disks)[i];
+    registry.Append(Entry({{"class", "VelmoraEmbeddedNVMeController"},
+                           {"name", device.substr(device.rfind('/') + 1)},
+                           {"id", cf::Value::UInt64(kPlatformId + 0x900 + i)},
+                           {"parent", cf::Value::UInt64(kPlatformId)},
+                           {"userClient", "host"},
+                           {"properties", Entry({{"device", device}})}}));
+  }
+  return WritePlist(c.Path("/device/registry.plist"), registry, error) &&
+         WriteLibraryAndStore(c, support_library, error);
+}
+
+bool WriteDefaultRoot(const std::string& root, const std::string& support_library, std::string* error) {
+  platform::ContextScope scope(root);
+  platform::Context& c = scope.context();
+  if (!WriteCommonFiles(c, false, error)) return false;
   cf::Dictionary version;
   version.Set("ProductName", "boxOS");
   version.Set("ProductVersion", "4.2");
@@ -251,20 +310,5 @@ bool WriteDefaultRoot(const std::string& root, const std::string& support_librar
     return false;
   if (!WritePlist(c.Path("/device/apps.plist"), Apps(), error)) return false;
   if (!WritePlist(c.Path(kUsageDevicePath), Usage(TBDaysSince1970()), error)) return false;
-  if (!WritePlist(c.Path("/var/eventlens/enabled-events.plist"), EnabledEvents(), error)) return false;
-  const auto library = platform::ReadFile(support_library, error);
-  if (!library || !platform::WriteFileAtomically(c.Path(kFaultkeepSupportPath), *library, error, 0755)) return false;
-
-  // A fresh store: yesterday in full, today up to the clock's time of day.
-  const std::string store_path = c.Path(platform::kStoreDevicePath);
-  for (const char* suffix : {"", "-wal", "-shm"}) unlink((store_path + suffix).c_str());
-  auto store = platform::TallyStore::Open(store_path, platform::TallyStore::Mode::kCreate, error);
-  if (!store) return false;
-  const int32_t today = TBDaysSince1970();
-  const double fraction = std::clamp((platform::Now() - platform::StartOfDay(today)) / 86400.0, 0.05, 1.0);
-  if (!FillDay(*store, today - 1, 1.0) || !FillDay(*store, today, fraction) || !store->Checkpoint()) {
-    if (error) *error = store->last_error();
-    return false;
-  }
-  return true;
+  return WriteLibraryAndStore(c, support_library, error);
 }

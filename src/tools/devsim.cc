@@ -1,5 +1,6 @@
 // devsim: the simulated device's tools. `devsim init DIR` writes a complete
-// default device root; the others show what a root's devices give.
+// default device root (with --host, one whose controllers are this machine's
+// disks); the others show what a root's devices give.
 
 #include <unistd.h>
 
@@ -315,6 +316,8 @@ int main(int argc, char** argv) {
   auto* init = app.add_subcommand("init", "Write a complete default device root into DIR");
   init->add_option("DIR", dir)->required();
   init->add_flag("--force", force, "replace the device root already in DIR: everything in it is removed first");
+  bool host = false;
+  init->add_flag("--host", host, "list this machine's disks as the storage controllers; simulate nothing else");
   std::string kind, file, header_file;
   auto* parse = app.add_subcommand("parse", "Parse a raw statistics buffer: one 'name value' line per pair");
   parse->add_option("KIND", kind, "ftl, stats or msp")->required()->check(CLI::IsMember({"ftl", "stats", "msp"}));
@@ -360,10 +363,14 @@ int main(int argc, char** argv) {
     }
     if (force && !ClearOldRoot(dir)) return 2;
     std::string error;
-    if (!WriteDefaultRoot(std::filesystem::absolute(dir).string(), SupportLibrary(), &error)) {
+    const std::string where = std::filesystem::absolute(dir).string();
+    std::vector<std::string> disks;
+    if (!(host ? WriteHostRoot(where, SupportLibrary(), &disks, &error)
+               : WriteDefaultRoot(where, SupportLibrary(), &error))) {
       std::fprintf(stderr, "devsim: %s\n", error.c_str());
       return 1;
     }
+    if (host && disks.empty()) std::fprintf(stderr, "devsim: this machine shows no disks in /sys/block\n");
     std::printf("%s\n", std::filesystem::absolute(dir).string().c_str());
   }
   return 0;
