@@ -392,7 +392,7 @@ TEST_F(TallyrunTest, ToolsRefuseBadInput) {
 
   r = RunProgram(DEVSIM_BIN, {"init", root.path()}, env);
   EXPECT_EQ(r.status, 2);
-  EXPECT_EQ(r.err, "devsim: " + root.path() + " is not empty (use --force to write into it)\n");
+  EXPECT_EQ(r.err, "devsim: " + root.path() + " is not empty (use --force to replace the device root in it)\n");
 }
 
 }  // namespace

@@ -21,12 +21,6 @@ std::vector<std::string> Lines(const std::string& text, bool words = false) {
 }
 std::vector<std::string> Fields(const std::string& line) { return Lines(line, true); }
 
-std::string G16(double d) {
-  char buf[64];
-  std::snprintf(buf, sizeof buf, "%0.16g", d);
-  return buf;
-}
-
 class ToolOutputTest : public ::testing::Test {
  protected:
   TempDir root;
@@ -79,9 +73,9 @@ TEST_F(ToolOutputTest, DumpJsonLinesMatchTheTextDump) {
     } else {
       EXPECT_EQ(o.size(), 7u);
       EXPECT_EQ(std::to_string(o.Get("count").AsNumber()->AsSInt64()), f[f.size() - 4]);
-      EXPECT_EQ(G16(o.Get("min").AsNumber()->AsFloat64()), f[f.size() - 3]);
-      EXPECT_EQ(G16(o.Get("max").AsNumber()->AsFloat64()), f[f.size() - 2]);
-      EXPECT_EQ(G16(o.Get("mean").AsNumber()->AsFloat64()), f[f.size() - 1]);
+      EXPECT_EQ(o.Get("min").AsNumber()->AsFloat64(), std::stod(f[f.size() - 3]));  // both read back exactly
+      EXPECT_EQ(o.Get("max").AsNumber()->AsFloat64(), std::stod(f[f.size() - 2]));  // both read back exactly
+      EXPECT_EQ(o.Get("mean").AsNumber()->AsFloat64(), std::stod(f[f.size() - 1]));  // both read back exactly
     }
   }
   // The exact lines: dates of the local day, escaped keys, and reals as the
