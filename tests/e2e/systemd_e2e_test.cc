@@ -1,11 +1,14 @@
 // tallyrun under a service manager: the listening socket handed over at
-// start.
+// start, and the install that puts the programs, the support library and
+// the units in place.
 #include <sys/file.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 
 #include <cstring>
+#include <fstream>
+#include <sstream>
 
 #include "root_fixture.h"
 
@@ -140,6 +143,107 @@ TEST_F(HandedSocketTest, ServesTheSocketItIsHandedAndLeavesItsPath) {
     fs::remove(socket_path);
     fs::remove(elsewhere);
   }
+}
+
+std::string ReadText(const std::string& path) {
+  std::ifstream in(path);
+  std::stringstream s;
+  s << in.rdbuf();
+  return s.str();
+}
+
+// "key=value" lines of a unit file, each with its section ("[Socket]ListenStream=...").
+std::vector<std::string> UnitLines(const std::string& path) {
+  std::vector<std::string> out;
+  std::istringstream in(ReadText(path));
+  std::string section, line;
+  while (std::getline(in, line)) {
+    if (line.empty() || line[0] == '#') continue;
+    if (line[0] == '[') section = line;
+    else out.push_back(section + line);
+  }
+  return out;
+}
+
+bool Has(const std::vector<std::string>& lines, const std::string& line) {
+  return std::find(lines.begin(), lines.end(), line) != lines.end();
+}
+
+RunResult Install(const std::string& prefix, const std::string& destdir) {
+  std::map<std::string, std::string> env;
+  if (!destdir.empty()) env["DESTDIR"] = destdir;
+  return RunProgram(CMAKE_COMMAND, {"--install", BUILD_DIR, "--prefix", prefix}, env);
+}
+
+// Where the units land for an install with this prefix.
+std::string UnitDir(const std::string& prefix) {
+  const std::string dir = SYSTEMD_UNIT_DIR;
+  return (dir[0] == '/' ? dir : prefix + "/" + dir) + "/";
+}
+
+const std::vector<std::string> kUnits = {"tallyrun.service", "tallyrun.socket", "tallyrun-daily.service",
+                                         "tallyrun-daily.timer"};
+
+TEST(InstallTest, PutsProgramsLibraryAndUnitsInPlace) {
+  TempDir stage;
+  const RunResult r = Install("/usr", stage.path());
+  ASSERT_EQ(r.status, 0) << r.out << r.err;
+  const std::string usr = stage / "usr";
+  for (const char* program : {"tallyrun", "tallybook", "tallyctl", "devsim"}) {
+    SCOPED_TRACE(program);
+    const std::string path = usr + "/" + INSTALL_BINDIR + "/" + program;
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0);
+    EXPECT_TRUE(S_ISREG(st.st_mode));
+    EXPECT_EQ(st.st_mode & 0111, 0111u);
+  }
+  const std::string library = usr + "/" + SUPPORT_INSTALL_DIR + "/FaultkeepSupport";
+  EXPECT_EQ(ReadText(library).substr(0, 4), "\x7f" "ELF") << library;
+
+  const std::string root = TALLYRUN_DEVICE_ROOT;
+  const std::string units = stage.path() + UnitDir("/usr");
+  const auto socket = UnitLines(units + "tallyrun.socket");
+  EXPECT_TRUE(Has(socket, "[Socket]ListenStream=" + root + "/var/run/com.velmora.tallybookd.tallyrun.sock"));
+  EXPECT_TRUE(Has(socket, "[Socket]SocketMode=0600"));
+  EXPECT_TRUE(Has(socket, "[Install]WantedBy=sockets.target"));
+  const auto service = UnitLines(units + "tallyrun.service");
+  EXPECT_TRUE(Has(service, "[Service]Environment=TALLYRUN_ROOT=" + root));
+  // The prefix of the install, not the one the build was configured with.
+  const std::string tallyrun = std::string("/usr/") + INSTALL_BINDIR + "/tallyrun";
+  EXPECT_TRUE(Has(service, "[Service]ExecStart=" + tallyrun));
+  const auto daily = UnitLines(units + "tallyrun-daily.service");
+  EXPECT_TRUE(Has(daily, "[Service]Environment=TALLYRUN_ROOT=" + root));
+  EXPECT_TRUE(Has(daily, "[Service]ExecStart=" + tallyrun + " -d"));
+  const auto timer = UnitLines(units + "tallyrun-daily.timer");
+  EXPECT_TRUE(Has(timer, "[Timer]OnCalendar=daily"));
+  EXPECT_TRUE(Has(timer, "[Timer]Persistent=true"));
+  EXPECT_TRUE(Has(timer, "[Install]WantedBy=timers.target"));
+  for (const std::string& unit : kUnits) {
+    SCOPED_TRACE(unit);
+    const std::string text = ReadText(units + unit);
+    EXPECT_FALSE(text.empty());
+    EXPECT_EQ(text.find('@'), std::string::npos) << "a template variable left unexpanded";
+  }
+}
+
+TEST(InstallTest, UnitsPassSystemdAnalyzeVerify) {
+  std::string analyze;
+  for (const char* dir : {"/usr/bin", "/bin", "/usr/local/bin"})
+    if (access((std::string(dir) + "/systemd-analyze").c_str(), X_OK) == 0) analyze = std::string(dir) + "/systemd-analyze";
+  if (analyze.empty()) GTEST_SKIP() << "systemd-analyze is not installed; the units are not checked";
+  if (SYSTEMD_UNIT_DIR[0] == '/' || INSTALL_BINDIR[0] == '/')
+    GTEST_SKIP() << "this build installs outside its prefix; the units are not checked here";
+  // Installed into a real prefix, so that the programs the units start exist.
+  TempDir prefix;
+  const RunResult install = Install(prefix.path(), "");
+  ASSERT_EQ(install.status, 0) << install.out << install.err;
+  std::vector<std::string> args = {"verify", "--man=no"};
+  for (const std::string& unit : kUnits) args.push_back(prefix.path() + UnitDir("") + unit);
+  const RunResult r = RunProgram(analyze, args, {});
+  std::printf("systemd-analyze verify: exit %d%s%s\n", r.status, r.err.empty() ? ", no findings" : "\n",
+              r.err.c_str());
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_EQ(r.err, "") << "every finding is a fault in a unit";
 }
 
 }  // namespace
