@@ -5,6 +5,7 @@
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "platform/service.h"
 #include "platform/store.h"
 #include "platform/upkeep.h"
 
@@ -28,11 +29,15 @@ int TallyrunMain(int argc, char** argv) {
   LogDefault("tallyrun started");
   // One instance at a time: a run waits for the one before it (and then
   // finds its gate record); a service that finds another one running leaves
-  // that one its socket.
+  // that one its socket. A service the service manager started for a
+  // waiting peer waits its turn instead: leaving would hand the socket back
+  // still readable, and the manager would start it again at once, over and
+  // over.
+  const bool serve_alone = argc == 1 && !platform::ServiceSocketHandedOver();
   std::string lock_error;
   const auto lock = platform::FileLock::Acquire(
       platform::Context::Current().Path(kInstanceLockPath),
-      argc == 1 ? platform::FileLock::Wait::kTry : platform::FileLock::Wait::kBlock, &lock_error);
+      serve_alone ? platform::FileLock::Wait::kTry : platform::FileLock::Wait::kBlock, &lock_error);
   if (!lock && lock_error.empty()) {
     LogDefault("Another tallyrun is running; leaving the work to it");
     LogDefault("tallyrun ended");
@@ -51,7 +56,7 @@ int TallyrunMain(int argc, char** argv) {
     const double idle = IdleSeconds();
     while (CFRunLoopRunInMode(idle, true) != platform::kCFRunLoopRunTimedOut) {
     }
-    xpc_connection_cancel(listener);  // removes the socket
+    xpc_connection_cancel(listener);  // removes the socket we bound
     if (gAppInfoRequested) {
       LogDefault("never received requested AAI, so moving along without it");
       RunDailyTasksIfDayChanged(cf::Value());

@@ -6,6 +6,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -68,6 +69,27 @@ void Unwatch(const XPCConnection* c) {
 
 void Deliver(const xpc_handler_t& handler, XPCEvent event) {
   if (handler) handler(event);
+}
+
+// What the service manager announced at start. A broken announcement (a
+// count that is no number, a descriptor that is not open) still counts as
+// one, so that it is reported rather than taken for a start by hand.
+struct HandedOver {
+  bool announced = false;
+  int count = 0;  // descriptors from SD_LISTEN_FDS_START on
+  int error = 0;  // errno of a broken announcement
+};
+
+const HandedOver& TakeHandedOver() {
+  static const HandedOver taken = [] {
+    HandedOver h;
+    const int n = sd_listen_fds(1);
+    h.announced = n != 0;
+    if (n < 0) h.error = -n;
+    else h.count = n;
+    return h;
+  }();
+  return taken;
 }
 
 uint32_t BigEndian32(const char* p) {
@@ -192,6 +214,8 @@ bool XPCConnection::OnReady() {
   return delivered;
 }
 
+bool ServiceSocketHandedOver() { return TakeHandedOver().announced; }
+
 std::string ServiceSocketPath(std::string_view service_name) {
   return Context::Current().Path("/var/run/" + std::string(service_name) + ".sock");
 }
@@ -300,6 +324,31 @@ bool ClearSocketPath(const std::string& path, const sockaddr_un& addr) {
   return true;
 }
 
+// The listener on the socket the service manager handed over, once it is
+// the one this service's peers reach. Its path stays empty: the manager
+// made the socket file and removes it, not us.
+xpc_connection_t AdoptHandedOverSocket(const std::string& path) {
+  const auto refuse = [](const HandedOver& h, const std::string& why) -> xpc_connection_t {
+    LogError("Not serving the socket handed over at start: %s", why);
+    for (int i = 0; i < h.count; ++i) close(SD_LISTEN_FDS_START + i);
+    return nullptr;
+  };
+  const HandedOver& h = TakeHandedOver();
+  if (h.error != 0) return refuse(h, std::string("the announcement is broken (") + std::strerror(h.error) + ")");
+  if (h.count != 1) return refuse(h, cf::Format("%d sockets were handed over, not one", h.count));
+  const int fd = SD_LISTEN_FDS_START;
+  if (sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) <= 0)
+    return refuse(h, "it is not a listening Unix stream socket");
+  if (sd_is_socket_unix(fd, SOCK_STREAM, 1, path.c_str(), 0) <= 0) return refuse(h, "it is not bound to " + path);
+  // The run loop polls before it accepts; a peer that gives up in between
+  // must not leave accept blocking.
+  const int fl = fcntl(fd, F_GETFL);
+  if (fl < 0 || fcntl(fd, F_SETFL, fl | O_NONBLOCK) != 0)
+    return refuse(h, std::string("cannot make it non-blocking (") + std::strerror(errno) + ")");
+  LogDebug("Serving the socket handed over at start (%s)", path);
+  return std::make_shared<XPCConnection>(fd, true, "");
+}
+
 }  // namespace
 
 xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint64_t flags) {
@@ -315,6 +364,7 @@ xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint6
     return nullptr;
   }
   std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  if (ServiceSocketHandedOver()) return AdoptHandedOverSocket(path);
   const size_t slash = path.find_last_of('/');
   if (!MakeDirectories(path.substr(0, slash))) {
     LogError("Cannot create the directory of %s: %s", path, std::strerror(errno));

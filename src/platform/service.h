@@ -43,6 +43,18 @@ inline constexpr int32_t kCFRunLoopRunHandledSource = 4;
 
 std::string ServiceSocketPath(std::string_view service_name);
 
+// Whether the service manager that started this process handed it its
+// listening socket (LISTEN_PID names this process and LISTEN_FDS is set).
+// The answer is taken once, at the first call, and the variables are then
+// cleared so that nothing this process starts mistakes them for its own.
+// When true, xpc_connection_create_mach_service serves that socket: it
+// neither binds nor removes the path, which belongs to the manager. A
+// handed-over socket that cannot be served (more than one, not a listening
+// Unix stream socket, bound elsewhere than the service's path) is refused
+// with one error line, and the service listens on nothing: binding a second
+// socket beside the manager's would leave peers talking to the wrong one.
+bool ServiceSocketHandedOver();
+
 // Sends one message to the service of the current root. False with a reason
 // when there is no socket or the message cannot be sent.
 bool SendServiceMessage(std::string_view service_name, const cf::Value& message, std::string* error);
@@ -80,7 +92,8 @@ size_t ServiceBufferedBytes();
 
 }  // namespace platform
 
-// Null when the socket cannot be created (the reason goes to the log).
+// Null when the socket cannot be created, or a handed-over one cannot be
+// served (the reason goes to the log).
 platform::xpc_connection_t xpc_connection_create_mach_service(std::string_view name, uint64_t flags);
 void xpc_connection_set_event_handler(const platform::xpc_connection_t& connection, platform::xpc_handler_t handler);
 // Every connection targets the main queue here; kept for the call sites.

@@ -141,14 +141,17 @@ bool ClearOldRoot(const std::string& dir) {
   return true;
 }
 
-// The support library built beside devsim; found from devsim's own place
-// first, so a moved build tree still works, then where the build put it.
+// The support library, found from devsim's own place first: beside it in a
+// build tree (so a moved tree still works), or where an install put it
+// (relative, so any prefix or staging directory works); then where the
+// build put it.
 std::string SupportLibrary() {
   std::error_code ec;
   const auto self = std::filesystem::read_symlink("/proc/self/exe", ec);
   if (!ec) {
-    const auto beside = self.parent_path().parent_path() / "platform" / "FaultkeepSupport";
-    if (std::filesystem::exists(beside, ec)) return beside.string();
+    for (const auto& candidate : {self.parent_path().parent_path() / "platform" / "FaultkeepSupport",
+                                  self.parent_path() / INSTALLED_SUPPORT_LIBRARY})
+      if (std::filesystem::exists(candidate, ec)) return candidate.lexically_normal().string();
   }
   return FAULTKEEP_SUPPORT_LIBRARY;
 }
