@@ -23,6 +23,7 @@
 #include "platform/files.h"
 #include "tools/cli.h"
 #include "tools/default_root.h"
+#include "tools/output.h"
 
 namespace {
 
@@ -164,12 +165,7 @@ int Controller(const std::string& root) {
   const cf::Value nand = CopyNANDInfo();
   if (const cf::Dictionary* d = nand.AsDictionary()) info = d->MutableCopy();
   for (const auto& [key, value] : CopyVMFreezerNANDInfo()) info.Set(key, value);
-  std::string json, error;
-  if (!cf::WriteJSON(info, json, &error, 2)) {
-    std::fprintf(stderr, "devsim: %s\n", error.c_str());
-    return 1;
-  }
-  std::printf("%s\n", json.c_str());
+  std::printf("%s\n", tools::JSONText(info, 2).c_str());
   if (info.Contains("com.velmora.NANDInfo.Error")) {
     std::fprintf(stderr, "devsim: the controller of %s could not be read: %s\n", scope.context().root().c_str(),
                  GetAPIErrorMessage().c_str());
@@ -198,12 +194,7 @@ int Views(const std::string& root, bool round) {
   std::fflush(stdout);
   dup2(saved_stdout, STDOUT_FILENO);
   close(saved_stdout);
-  std::string json, error;
-  if (!cf::WriteJSON(views, json, &error, 2)) {
-    std::fprintf(stderr, "devsim: %s\n", error.c_str());
-    return 1;
-  }
-  std::printf("%s\n", json.c_str());
+  std::printf("%s\n", tools::JSONText(views, 2).c_str());
   return 0;
 }
 
@@ -294,9 +285,7 @@ int Reporting(const std::string& root, int64_t categories, bool json, double int
       out.Append(ChannelDelta(sample));
       return kIOReportIterOk;
     });
-    std::string text;
-    if (!cf::WriteJSON(out, text, nullptr, 2)) return fail("the channels could not be written as JSON");
-    std::printf("%s\n", text.c_str());
+    std::printf("%s\n", tools::JSONText(out, 2).c_str());
     return std::fflush(stdout) == 0 ? 0 : 1;
   }
   IOReturn written = kIOReturnSuccess;
