@@ -32,7 +32,10 @@ class SummaryReporter : public benchmark::ConsoleReporter {
   };
   void ReportRuns(const std::vector<Run>& runs) override {
     for (const Run& r : runs) {
-      Result& result = results[r.benchmark_name()];
+      // With repetitions, the summary takes each benchmark's median.
+      const bool aggregate = r.run_type == Run::RT_Aggregate;
+      if (aggregate && r.aggregate_name != "median") continue;
+      Result& result = results[aggregate ? r.run_name.str() : r.benchmark_name()];
       result.time = r.GetAdjustedRealTime() / benchmark::GetTimeUnitMultiplier(r.time_unit);
       if (auto it = r.counters.find(counter_); it != r.counters.end()) result.allocations = it->second;
     }

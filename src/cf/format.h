@@ -27,6 +27,7 @@ class FormatArg {
   FormatArg(float v) : kind_(Kind::kDouble), d_(v) {}
   FormatArg(const char* s) : kind_(Kind::kCString), s_(s) {}
   FormatArg(const std::string& s) : kind_(Kind::kCString), s_(s.c_str()) {}
+  FormatArg(const String& s) : kind_(Kind::kCString), s_(s.c_str()) {}
   FormatArg(const void* p) : kind_(Kind::kPointer), p_(p) {}
   FormatArg(const Value& v) : kind_(Kind::kValue), v_(&v) {}
   FormatArg(const Array& a) = delete;       // wrap in a Value first

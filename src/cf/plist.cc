@@ -306,7 +306,7 @@ bool WriteXMLNode(const Value& v, int depth, std::string& out, std::string& erro
       }
       out += "<dict>\n";
       for (const auto& [k, val] : d) {
-        const std::string* key = k.AsString();
+        const cf::String* key = k.AsString();
         if (!key) {
           error = "dictionary key of type " + std::string(TypeName(k.type())) +
                   " cannot be written to a property list";

@@ -4,10 +4,13 @@
 #include <cctype>
 #include <cmath>
 #include <cstdio>
+#include <cstring>
 #include <ctime>
 #include <functional>
 #include <limits>
+#include <new>
 #include <ostream>
+#include <stdexcept>
 
 namespace cf {
 
@@ -42,7 +45,127 @@ uint64_t LowBits(NumberType type, int64_t v) {
 
 size_t Mix(size_t h, size_t v) { return h ^ (v + 0x9e3779b97f4a7c15ULL + (h << 6) + (h >> 2)); }
 
+uint64_t Load8(const char* p) {
+  uint64_t w;
+  std::memcpy(&w, p, 8);
+  return w;
+}
+uint64_t Load4(const char* p) {
+  uint32_t w;
+  std::memcpy(&w, p, 4);
+  return w;
+}
+uint64_t Fold(uint64_t x) {
+  x ^= x >> 31;
+  x *= 0xbf58476d1ce4e5b9ULL;
+  return x ^ (x >> 29);
+}
+
+// Two lanes of 8-byte words, each folded by a multiply; the last words may
+// overlap the ones before. Names of a few dozen characters take a few
+// multiplies.
+uint32_t HashBytes(const char* p, size_t n) {
+  uint64_t a = 0x9e3779b97f4a7c15ULL ^ n, b = 0xc2b2ae3d27d4eb4fULL;
+  while (n > 16) {
+    a = Fold(a ^ Load8(p));
+    b = Fold(b ^ Load8(p + 8));
+    p += 16;
+    n -= 16;
+  }
+  if (n > 8) {
+    a ^= Load8(p);
+    b ^= Load8(p + n - 8);
+  } else if (n >= 4) {
+    a ^= Load4(p) | Load4(p + n - 4) << 32;
+  } else if (n > 0) {
+    a ^= static_cast<uint64_t>(static_cast<unsigned char>(p[0])) |
+         static_cast<uint64_t>(static_cast<unsigned char>(p[n / 2])) << 8 |
+         static_cast<uint64_t>(static_cast<unsigned char>(p[n - 1])) << 16;
+  }
+  const uint64_t h = Fold(Fold(a) ^ b);
+  return static_cast<uint32_t>(h ^ (h >> 32));
+}
+
+internal::TextBlock* NewTextBlock(size_t characters, size_t references) {
+  void* memory = ::operator new(sizeof(internal::TextBlock) + characters);
+  return new (memory) internal::TextBlock{references};
+}
+
+char* TextOf(internal::TextBlock* block) { return reinterpret_cast<char*>(block + 1); }
+
+// The 16 bytes of a string's representation, written with one store: the
+// caller moves the new string at once, and a 16-byte load of bytes that
+// narrower stores have just written waits for them to reach the cache.
+using Words = uint64_t __attribute__((vector_size(16)));
+template <typename Rep>
+void StoreRep(Rep& rep, Words words) {
+  static_assert(sizeof(Rep) == sizeof(Words));
+  std::memcpy(&rep, &words, sizeof words);
+}
+
+// Up to 15 characters and the zeros after them, as two little-endian words
+// read from the text without reading past it.
+Words LocalWords(const char* p, size_t n) {
+  uint64_t lo = 0, hi = 0;
+  if (n > 8) {
+    lo = Load8(p);
+    hi = Load8(p + n - 8) >> (8 * (16 - n));
+  } else if (n == 8) {
+    lo = Load8(p);
+  } else if (n >= 4) {
+    lo = Load4(p) | Load4(p + n - 4) << (8 * (n - 4));
+  } else {
+    for (size_t i = 0; i < n; ++i) lo |= static_cast<uint64_t>(static_cast<unsigned char>(p[i])) << (8 * i);
+  }
+  return Words{lo, hi};
+}
+
 }  // namespace
+
+// ---- strings ----
+
+size_t String::HashOf(std::string_view text) { return HashBytes(text.data(), text.size()); }
+size_t String::HashOfEmpty() {
+  static const size_t kHash = HashBytes("", 0);
+  return kHash;
+}
+
+String::String(std::string_view text) {
+  if (text.size() > std::numeric_limits<uint32_t>::max()) throw std::length_error("cf::String too long");
+  size_ = static_cast<uint32_t>(text.size());
+  hash_ = HashBytes(text.data(), text.size());
+  if (!IsShared()) {
+    StoreRep(rep_, LocalWords(text.data(), text.size()));
+    return;
+  }
+  internal::TextBlock* block = NewTextBlock(text.size() + 1, 1);
+  char* out = TextOf(block);
+  std::memcpy(out, text.data(), text.size());
+  out[text.size()] = 0;
+  StoreRep(rep_, Words{reinterpret_cast<uintptr_t>(block), reinterpret_cast<uintptr_t>(out)});
+}
+
+void String::Release(internal::TextBlock* block, size_t n) noexcept {
+  if (block->references.fetch_sub(n, std::memory_order_acq_rel) == n) {
+    block->~TextBlock();
+    ::operator delete(block);
+  }
+}
+
+std::ostream& operator<<(std::ostream& os, const String& s) { return os << s.view(); }
+
+StringBlock::StringBlock(size_t count, size_t characters) {
+  if (count == 0) return;
+  left_ = characters + count;
+  credits_ = count;
+  block_ = NewTextBlock(left_, count);
+  cursor_ = TextOf(block_);
+}
+
+StringBlock::~StringBlock() {
+  if (credits_) String::Release(block_, credits_);
+}
+
 
 bool Number::IsFloat() const {
   return type_ == NumberType::kFloat32 || type_ == NumberType::kFloat64 ||
@@ -173,8 +296,31 @@ class DictionaryImpl {
 
   static constexpr size_t kIndexThreshold = 12;
 
-  long FindIndex(const Value& key) const {
-    const size_t h = key.Hash();
+  DictionaryImpl() = default;
+  DictionaryImpl(const DictionaryImpl&) = default;
+  DictionaryImpl& operator=(const DictionaryImpl&) = default;
+  // Gives back the references of keys made in the same block one run at a
+  // time instead of one atomic step per key.
+  ~DictionaryImpl() {
+    internal::TextBlock* run = nullptr;
+    size_t n = 0;
+    for (auto& entry : entries) {
+      String* key = std::get_if<String>(&entry.first.v_);
+      if (!key || !key->IsShared()) continue;
+      if (key->rep_.shared.block != run) {
+        if (run) String::Release(run, n);
+        run = key->rep_.shared.block;
+        n = 0;
+      }
+      ++n;
+      key->ForgetBlock();
+    }
+    if (run) String::Release(run, n);
+  }
+
+  // Where key is (index into entries), or -1 and, when indexed, the free
+  // slot where it would go.
+  long FindIndex(const Value& key, size_t h, size_t* free_slot = nullptr) const {
     if (slots.empty()) {
       for (size_t i = 0; i < entries.size(); ++i)
         if (hashes[i] == h && entries[i].first == key) return static_cast<long>(i);
@@ -183,11 +329,15 @@ class DictionaryImpl {
     const size_t mask = slots.size() - 1;
     for (size_t s = h & mask;; s = (s + 1) & mask) {
       const uint32_t slot = slots[s];
-      if (slot == 0) return -1;
+      if (slot == 0) {
+        if (free_slot) *free_slot = s;
+        return -1;
+      }
       const size_t i = slot - 1;
       if (hashes[i] == h && entries[i].first == key) return static_cast<long>(i);
     }
   }
+  long FindIndex(const Value& key) const { return FindIndex(key, key.Hash()); }
 
   void Insert(size_t i) {
     const size_t mask = slots.size() - 1;
@@ -206,13 +356,17 @@ class DictionaryImpl {
     for (size_t i = 0; i < entries.size(); ++i) Insert(i);
   }
 
-  void Append(Value key, Value value) {
-    hashes.push_back(key.Hash());
+  // Appends a new key with hash h; free_slot, when known, is where its
+  // probe ended.
+  void Append(Value&& key, Value&& value, size_t h, const size_t* free_slot = nullptr) {
+    hashes.push_back(h);
     entries.emplace_back(std::move(key), std::move(value));
     if (slots.empty()) {
       if (entries.size() >= kIndexThreshold) Rebuild(entries.size());
     } else if (entries.size() * 2 > slots.size()) {
       Rebuild(entries.size());
+    } else if (free_slot) {
+      slots[*free_slot] = static_cast<uint32_t>(entries.size());
     } else {
       Insert(entries.size() - 1);
     }
@@ -255,14 +409,19 @@ const Value& Dictionary::Get(const Value& key) const {
   return v ? *v : kNull;
 }
 void Dictionary::Set(Value key, Value value) {
-  const long i = impl_->FindIndex(key);
+  const size_t h = key.Hash();
+  size_t free_slot = 0;
+  const long i = impl_->FindIndex(key, h, &free_slot);
   if (i >= 0) {
     impl_->entries[static_cast<size_t>(i)].second = std::move(value);
     return;
   }
-  impl_->Append(std::move(key), std::move(value));
+  impl_->Append(std::move(key), std::move(value), h, impl_->slots.empty() ? nullptr : &free_slot);
 }
-void Dictionary::AppendUnique(Value key, Value value) { impl_->Append(std::move(key), std::move(value)); }
+void Dictionary::AppendUnique(Value key, Value value) {
+  const size_t h = key.Hash();
+  impl_->Append(std::move(key), std::move(value), h);
+}
 void Dictionary::Remove(const Value& key) {
   const long i = impl_->FindIndex(key);
   if (i < 0) return;
@@ -356,7 +515,7 @@ size_t Value::Hash() const {
     case Type::kBoolean: return Mix(t, *AsBool());
     // Numbers hash without their type tag so 3 and 3.0 land together.
     case Type::kNumber: return AsNumber()->Hash();
-    case Type::kString: return std::hash<std::string>()(*AsString());
+    case Type::kString: return AsString()->hash();
     case Type::kData:
       return Mix(t, std::hash<std::string_view>()(std::string_view(
                         reinterpret_cast<const char*>(AsData()->data()), AsData()->size())));
@@ -386,15 +545,15 @@ std::string DateDescription(const Date& d) { return FormatUTC(d, false); }
 
 namespace {
 
-bool NeedsQuotes(const std::string& s) {
+bool NeedsQuotes(std::string_view s) {
   if (s.empty()) return true;
   for (unsigned char c : s)
     if (!(std::isalnum(c) || c == '_' || c == '.' || c == '-' || c >= 0x80)) return true;
   return false;
 }
 
-std::string Quoted(const std::string& s) {
-  if (!NeedsQuotes(s)) return s;
+std::string Quoted(std::string_view s) {
+  if (!NeedsQuotes(s)) return std::string(s);
   std::string out = "\"";
   for (char c : s) {
     if (c == '"' || c == '\\') out += '\\';
@@ -414,7 +573,7 @@ void Describe(const Value& v, int depth, bool nested, std::string& out) {
     case Type::kNull: out += "<null>"; return;
     case Type::kBoolean: out += *v.AsBool() ? "true" : "false"; return;
     case Type::kNumber: out += v.AsNumber()->Description(); return;
-    case Type::kString: out += nested ? Quoted(*v.AsString()) : *v.AsString(); return;
+    case Type::kString: out += nested ? Quoted(v.StringView()) : v.StringView(); return;
     case Type::kDate: out += DateDescription(*v.AsDate()); return;
     case Type::kData: {
       static const char* hex = "0123456789abcdef";

@@ -5,10 +5,17 @@
 // a Value copies the handle, so a cache written into a dictionary is seen by
 // everyone holding it. MutableCopy() makes a new container one level deep;
 // DeepCopy() copies every nested container.
+//
+// Strings are immutable. Short ones live in the Value; longer ones hold a
+// counted reference on shared bytes, so copying a string never copies its
+// characters, and each string carries its hash.
 #pragma once
 
+#include <atomic>
 #include <cstddef>
+#include <compare>
 #include <cstdint>
+#include <cstring>
 #include <iosfwd>
 #include <memory>
 #include <optional>
@@ -89,6 +96,155 @@ struct Date {
 class Value;
 class ArrayImpl;
 class DictionaryImpl;
+class StringBlock;
+
+namespace internal {
+// Counted bytes shared by the strings made in them; the characters follow.
+struct TextBlock {
+  std::atomic<size_t> references;
+};
+}  // namespace internal
+
+// An immutable string. Up to 15 characters are held inline; longer texts
+// point into a TextBlock whose reference count the string holds, so copies
+// share the bytes. The text is always followed by a NUL (c_str()). Safe to
+// copy and drop from several threads: the count is atomic and the bytes
+// never change.
+class String {
+ public:
+  String() noexcept : size_(0), hash_(HashOfEmpty()) { rep_.local[0] = 0; }
+  explicit String(std::string_view text);
+  explicit String(const char* text) : String(std::string_view(text)) {}
+  explicit String(const std::string& text) : String(std::string_view(text)) {}
+  String(const String& o) noexcept : size_(o.size_), hash_(o.hash_), rep_(o.rep_) {
+    if (IsShared()) rep_.shared.block->references.fetch_add(1, std::memory_order_relaxed);
+  }
+  String(String&& o) noexcept : size_(o.size_), hash_(o.hash_), rep_(o.rep_) { o.ForgetBlock(); }
+  String& operator=(const String& o) noexcept {
+    String copy(o);
+    Swap(copy);
+    return *this;
+  }
+  String& operator=(String&& o) noexcept {
+    String moved(std::move(o));
+    Swap(moved);
+    return *this;
+  }
+  ~String() {
+    if (IsShared()) Release(rep_.shared.block, 1);
+  }
+
+  const char* data() const { return IsShared() ? rep_.shared.data : rep_.local; }
+  const char* c_str() const { return data(); }
+  size_t size() const { return size_; }
+  size_t length() const { return size_; }
+  bool empty() const { return size_ == 0; }
+  std::string_view view() const { return {data(), size_}; }
+  std::string str() const { return std::string(view()); }
+  operator std::string_view() const { return view(); }
+  operator std::string() const { return str(); }
+  size_t hash() const { return hash_; }
+  // Reading as a std::string would.
+  static constexpr size_t npos = std::string_view::npos;
+  char operator[](size_t i) const { return data()[i]; }
+  const char* begin() const { return data(); }
+  const char* end() const { return data() + size_; }
+  size_t find(std::string_view s, size_t pos = 0) const { return view().find(s, pos); }
+  size_t find(char c, size_t pos = 0) const { return view().find(c, pos); }
+  size_t rfind(std::string_view s, size_t pos = npos) const { return view().rfind(s, pos); }
+  size_t rfind(char c, size_t pos = npos) const { return view().rfind(c, pos); }
+  friend std::string operator+(const String& a, std::string_view b) { return a.str().append(b); }
+  friend std::string operator+(const String& a, const char* b) { return a.str().append(b); }
+  friend std::string operator+(std::string a, const String& b) { return a.append(b.view()); }
+  friend std::string operator+(const char* a, const String& b) { return std::string(a).append(b.view()); }
+  // True when both hold the same shared bytes (not merely equal texts).
+  bool SharesBytesWith(const String& o) const {
+    return IsShared() && o.IsShared() && rep_.shared.block == o.rep_.shared.block && rep_.shared.data == o.rep_.shared.data;
+  }
+
+  friend bool operator==(const String& a, const String& b) {
+    if (a.size_ != b.size_ || a.hash_ != b.hash_) return false;
+    return a.data() == b.data() || std::memcmp(a.data(), b.data(), a.size_) == 0;
+  }
+  friend bool operator==(const String& a, std::string_view b) { return a.view() == b; }
+  friend bool operator==(const String& a, const char* b) { return a.view() == std::string_view(b); }
+  friend bool operator==(const String& a, const std::string& b) { return a.view() == std::string_view(b); }
+  friend auto operator<=>(const String& a, const String& b) { return a.view() <=> b.view(); }
+  friend auto operator<=>(const String& a, std::string_view b) { return a.view() <=> b; }
+  friend std::ostream& operator<<(std::ostream& os, const String& s);
+
+  // The hash every string of these characters carries.
+  static size_t HashOf(std::string_view text);
+
+ private:
+  friend class StringBlock;
+  friend class DictionaryImpl;
+  static constexpr size_t kLocalCapacity = 15;  // plus the NUL
+
+  bool IsShared() const { return size_ > kLocalCapacity; }
+  // A long text already copied from text to data, whose reference on block
+  // the new string takes over. Hashes the original: reading back bytes just
+  // stored waits for the stores.
+  String(internal::TextBlock* block, const char* data, std::string_view text) noexcept
+      : size_(static_cast<uint32_t>(text.size())), hash_(static_cast<uint32_t>(HashOf(text))) {
+    rep_.shared.block = block;
+    rep_.shared.data = data;
+  }
+  static size_t HashOfEmpty();
+  // Leaves this an empty string without giving back its reference.
+  void ForgetBlock() noexcept {
+    size_ = 0;
+    rep_.local[0] = 0;
+  }
+  void Swap(String& o) noexcept {
+    std::swap(size_, o.size_);
+    std::swap(hash_, o.hash_);
+    std::swap(rep_, o.rep_);
+  }
+  static void Release(internal::TextBlock* block, size_t n) noexcept;
+
+  uint32_t size_;
+  uint32_t hash_;
+  union Rep {
+    struct {
+      internal::TextBlock* block;
+      const char* data;
+    } shared;
+    char local[kLocalCapacity + 1];
+  } rep_;
+};
+
+// Makes many strings in one allocation: for builders that know up front how
+// many strings and characters they will make. Each string made holds its
+// own reference on the block; the block goes when the last one does.
+class StringBlock {
+ public:
+  // Room for `count` strings of `characters` characters in all (NULs not
+  // included).
+  StringBlock(size_t count, size_t characters);
+  StringBlock(const StringBlock&) = delete;
+  StringBlock& operator=(const StringBlock&) = delete;
+  ~StringBlock();
+  // A string of text. Beyond the room asked for, strings are made on their
+  // own, as String(text) would make them. Inline, so that the new string's
+  // fields go straight to where the caller keeps it.
+  String Make(std::string_view text) {
+    if (text.size() <= String::kLocalCapacity || credits_ == 0 || text.size() >= left_) return String(text);
+    std::memcpy(cursor_, text.data(), text.size());
+    cursor_[text.size()] = 0;
+    String s(block_, cursor_, text);
+    cursor_ += text.size() + 1;
+    left_ -= text.size() + 1;
+    --credits_;
+    return s;
+  }
+
+ private:
+  internal::TextBlock* block_ = nullptr;
+  char* cursor_ = nullptr;
+  size_t left_ = 0;     // characters, NULs included
+  size_t credits_ = 0;  // references taken for strings not made yet
+};
 
 // Shared handle to a mutable array. A default-constructed Array is a new,
 // empty array.
@@ -158,9 +314,10 @@ class Value {
   Value() = default;
   Value(std::nullptr_t) {}
   Value(Number n) : v_(n) {}
-  Value(const char* s) : v_(std::string(s)) {}
-  Value(std::string s) : v_(std::move(s)) {}
-  Value(std::string_view s) : v_(std::string(s)) {}
+  Value(const char* s) : v_(String(s)) {}
+  Value(const std::string& s) : v_(String(s)) {}
+  Value(std::string_view s) : v_(String(s)) {}
+  Value(String s) : v_(std::move(s)) {}
   Value(Date d) : v_(d) {}
   Value(Array a) : v_(std::move(a)) {}
   Value(Dictionary d) : v_(std::move(d)) {}
@@ -186,7 +343,12 @@ class Value {
   // Borrowed views; null when the value has another type.
   const bool* AsBool() const { return std::get_if<bool>(&v_); }
   const Number* AsNumber() const { return std::get_if<Number>(&v_); }
-  const std::string* AsString() const { return std::get_if<std::string>(&v_); }
+  const String* AsString() const { return std::get_if<String>(&v_); }
+  // The characters of a string; empty for other types.
+  std::string_view StringView() const {
+    const String* s = AsString();
+    return s ? s->view() : std::string_view();
+  }
   const Data* AsData() const;
   const Date* AsDate() const { return std::get_if<Date>(&v_); }
   const Array* AsArray() const { return std::get_if<Array>(&v_); }
@@ -205,8 +367,8 @@ class Value {
   Value DeepCopy() const;
 
  private:
-  std::variant<std::monostate, bool, Number, std::string, std::shared_ptr<const Data>, Date, Array,
-               Dictionary>
+  friend class DictionaryImpl;
+  std::variant<std::monostate, bool, Number, String, std::shared_ptr<const Data>, Date, Array, Dictionary>
       v_;
 };
 

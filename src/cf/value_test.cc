@@ -4,7 +4,10 @@
 
 #include <cmath>
 #include <limits>
+#include <string>
+#include <thread>
 #include <unordered_set>
+#include <vector>
 
 namespace cf {
 namespace {
@@ -121,6 +124,147 @@ TEST(ValueTest, AnyValueIsAKeyAndLargeDictionariesStayOrdered) {
   EXPECT_EQ(Value::Bytes({1, 2}), Value::Bytes({1, 2}));
   std::unordered_set<Value, ValueHash> set{Value::SInt32(3), Value::Float64(3.0), Value("3")};
   EXPECT_EQ(set.size(), 2u);
+}
+
+// Texts across the inline limit (15) and beyond a name's 98 characters,
+// with a NUL and bytes above 0x7f inside.
+std::vector<std::string> TextsOfEveryLength() {
+  std::vector<std::string> texts;
+  for (size_t n : {0, 1, 7, 8, 9, 15, 16, 17, 31, 32, 33, 98, 300}) {
+    std::string t;
+    for (size_t i = 0; i < n; ++i) t += static_cast<char>("ab\0\xe9z"[i % 5]);
+    texts.push_back(t);
+  }
+  return texts;
+}
+
+TEST(StringTest, MadeAloneOrInABlockTheTextsAreTheSame) {
+  const std::vector<std::string> texts = TextsOfEveryLength();
+  size_t characters = 0;
+  for (const std::string& t : texts) characters += t.size();
+  StringBlock block(texts.size(), characters);
+  for (const std::string& t : texts) {
+    SCOPED_TRACE(t.size());
+    const String alone(t), made = block.Make(t);
+    for (const String* s : {&alone, &made}) {
+      EXPECT_EQ(s->view(), std::string_view(t));
+      EXPECT_EQ(s->size(), t.size());
+      EXPECT_EQ(s->c_str()[t.size()], '\0');
+      EXPECT_EQ(s->hash(), String::HashOf(t));
+      EXPECT_EQ(static_cast<std::string>(*s), t);
+    }
+    EXPECT_EQ(alone, made);
+    // Only long texts are shared; short ones are held inline.
+    EXPECT_EQ(made.SharesBytesWith(String(made)), t.size() > 15);
+    EXPECT_FALSE(made.SharesBytesWith(alone));
+    const Value a(alone), b(made), c(t);
+    EXPECT_EQ(a, b);
+    EXPECT_EQ(b, c);
+    EXPECT_EQ(a.Hash(), b.Hash());
+    EXPECT_EQ(b.Hash(), c.Hash());
+    EXPECT_EQ(b.StringView(), std::string_view(t));
+    Dictionary d;
+    d.Set(b, Value::SInt32(1));
+    d.Set(a, Value::SInt32(2));  // the same key
+    ASSERT_EQ(d.size(), 1u);
+    EXPECT_EQ(d.Get(c), Value::SInt32(2));
+  }
+  EXPECT_EQ(Value::SInt32(1).AsString(), nullptr);
+  EXPECT_TRUE(Value::SInt32(1).StringView().empty());
+  EXPECT_EQ(String().c_str(), std::string(""));
+}
+
+TEST(StringTest, EveryCharacterCountsInTheHashAndEquality) {
+  for (size_t n = 1; n <= 40; ++n) {
+    const std::string base(n, 'q');
+    const String s(base);
+    for (size_t i = 0; i < n; ++i) {
+      std::string other = base;
+      other[i] = 'r';
+      SCOPED_TRACE(std::to_string(n) + " at " + std::to_string(i));
+      EXPECT_NE(String(other).hash(), s.hash());
+      EXPECT_NE(String(other), s);
+      EXPECT_NE(Value(other), Value(base));
+    }
+  }
+  // Same bytes, different lengths.
+  EXPECT_NE(String(std::string(16, '\0')), String(std::string(17, '\0')));
+  EXPECT_NE(String(std::string(16, '\0')).hash(), String(std::string(17, '\0')).hash());
+}
+
+TEST(StringTest, SharedBytesLiveAsLongAsAnyStringMadeInThem) {
+  const std::string long1(40, 'x'), long2(60, 'y');
+  std::vector<String> kept;
+  {
+    StringBlock block(2, long1.size() + long2.size());
+    kept.push_back(block.Make(long1));
+    kept.push_back(block.Make(long2));
+    // Beyond the room asked for: made on its own, still right.
+    const String extra = block.Make(long1);
+    EXPECT_EQ(extra, long1);
+    EXPECT_FALSE(extra.SharesBytesWith(kept[0]));
+  }
+  {
+    StringBlock unused(3, 300);  // credits never used are given back
+  }
+  String copy = kept[0];
+  EXPECT_TRUE(copy.SharesBytesWith(kept[0]));
+  // Assigning to a copy leaves the shared bytes alone.
+  copy = String(std::string(50, 'z'));
+  EXPECT_EQ(kept[0], long1);
+  String moved = std::move(kept[1]);
+  EXPECT_EQ(moved, long2);
+  EXPECT_TRUE(kept[1].empty());
+  kept.clear();
+  EXPECT_EQ(moved, long2);
+
+  // Dropping copies on several threads at once.
+  StringBlock block(1, long1.size());
+  const String shared = block.Make(long1);
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t)
+    threads.emplace_back([&shared] {
+      for (int i = 0; i < 20000; ++i) {
+        String c = shared;
+        Value v(c);
+        if (v.StringView().size() != 40) std::abort();
+      }
+    });
+  for (std::thread& t : threads) t.join();
+  EXPECT_EQ(shared, long1);
+}
+
+TEST(StringTest, DictionariesOfSharedKeysGiveBackEveryReference) {
+  // Keys from two blocks, interleaved with inline and ordinary ones; some
+  // are kept past the dictionary, one dictionary is copied first.
+  const auto name = [](char c, int i) { return std::string(30, c) + std::to_string(i); };
+  StringBlock a(20, 20 * 32), b(20, 20 * 32);
+  Value kept_a, kept_b;
+  Dictionary copy;
+  {
+    Dictionary d;
+    for (int i = 0; i < 20; ++i) {
+      d.Set(a.Make(name('a', i)), Value::SInt32(i));
+      d.Set(b.Make(name('b', i)), Value::SInt32(100 + i));
+      d.Set(Value("short" + std::to_string(i)), Value::SInt32(200 + i));
+      d.Set(Value(name('c', i)), Value::SInt32(300 + i));
+    }
+    d.Set(Value(name('a', 3)), Value::SInt32(-3));  // replaces, keeps the place
+    ASSERT_EQ(d.size(), 80u);
+    EXPECT_EQ(d.entries()[12].first, Value(name('a', 3)));
+    EXPECT_EQ(d.entries()[12].second, Value::SInt32(-3));
+    kept_a = d.entries()[0].first;
+    kept_b = d.entries()[1].first;
+    copy = d.MutableCopy();
+    copy.Set(Value(name('b', 0)), Value::SInt32(7));
+    EXPECT_EQ(d.Get(Value(name('b', 0))), Value::SInt32(100));
+  }
+  EXPECT_EQ(kept_a, Value(name('a', 0)));
+  EXPECT_EQ(kept_b, Value(name('b', 0)));
+  EXPECT_EQ(copy.Get(kept_b), Value::SInt32(7));
+  EXPECT_EQ(copy.Get(Value(name('a', 19))), Value::SInt32(19));
+  copy.Clear();
+  EXPECT_EQ(kept_a.StringView(), name('a', 0));
 }
 
 TEST(ValueTest, Description) {

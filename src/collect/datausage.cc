@@ -38,10 +38,10 @@ std::optional<UsageRecord> ReadRecord(const cf::Value& value) {
   const cf::Dictionary* d = value.AsDictionary();
   if (!d) return std::nullopt;
   UsageRecord r;
-  if (const std::string* bundle = d->Get("bundleName").AsString()) {
+  if (const cf::String* bundle = d->Get("bundleName").AsString()) {
     r.name = *bundle;
     r.prefix = "";
-  } else if (const std::string* proc = d->Get("procName").AsString()) {
+  } else if (const cf::String* proc = d->Get("procName").AsString()) {
     r.name = *proc;
     r.prefix = "com.velmora.";
   } else {

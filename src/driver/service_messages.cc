@@ -17,7 +17,7 @@ bool gServiceTurnTaken = false;
 // with the reason in *why.
 const char* UncarriedText(const cf::Value& record, std::string* why) {
   for (const char* field : {"bundle_id", "version"}) {
-    const std::string* text = xpc_dictionary_get_string(record, field);
+    const cf::String* text = xpc_dictionary_get_string(record, field);
     if (text && !cf::IsPropertyListString(*text, why)) return field;
   }
   return nullptr;
@@ -33,8 +33,8 @@ void HandleServiceConnection(const XPCEvent& event) {
 }
 
 cf::Value AppInfoEntryFromRecord(const cf::Value& record) {
-  const std::string* bundle = xpc_dictionary_get_string(record, "bundle_id");
-  const std::string* version = xpc_dictionary_get_string(record, "version");
+  const cf::String* bundle = xpc_dictionary_get_string(record, "bundle_id");
+  const cf::String* version = xpc_dictionary_get_string(record, "version");
   const auto uuid = xpc_dictionary_get_uuid(record, "uuid");
   if (!bundle || !version || !uuid) return {};
   cf::Dictionary entry;

@@ -41,12 +41,12 @@ void Process(const cf::Value& entry, Action action, DomainSet& touched) {
   // be stored as pending and keep its whole domain from being written.
   const cf::Dictionary* e = entry.AsDictionary();
   const cf::Value key = e ? e->Get("Key") : cf::Value();
-  const std::string* domain = e ? e->Get("Domain").AsString() : nullptr;
+  const cf::String* domain = e ? e->Get("Domain").AsString() : nullptr;
   if (!key.AsString() || !domain) {
     LogError("Skipping a tasking entry without a string Key or Domain: %@", entry);
     return;
   }
-  const std::string* user_value = e->Get("User").AsString();
+  const cf::String* user_value = e->Get("User").AsString();
   const std::string user = user_value ? *user_value : std::string();
   const cf::Value value = action == Action::kApply ? e->Get("Value") : cf::Value();
   if (user == "mobile") {

@@ -180,7 +180,7 @@ cf::Value IOReportChannelGetSubGroup(const cf::Dictionary& channel) {
 }
 
 std::string IOReportChannelGetChannelName(const cf::Dictionary& channel) {
-  if (const std::string* cached = channel.Get("ChannelName").AsString()) return *cached;
+  if (const cf::String* cached = channel.Get("ChannelName").AsString()) return *cached;
   std::string name = "<unknown>";
   const cf::Array* legend = channel.Get("LegendChannel").AsArray();
   if (legend && legend->size() > 2 && legend->at(2).AsString()) {

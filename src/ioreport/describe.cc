@@ -89,7 +89,7 @@ cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::
 }
 
 IOReturn IOReportWriteStringUTF8(int fd, const cf::Value& string) {
-  const std::string* text = string.AsString();
+  const cf::String* text = string.AsString();
   if (!text) return kIOReturnBadArgument;
   if (!isUTF8(*text)) return kIOReturnNoMemory;  // no UTF-8 form to write
   const ssize_t written = platform::WriteToDescriptor(fd, *text);

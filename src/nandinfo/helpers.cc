@@ -16,10 +16,10 @@ std::unordered_set<std::string_view> AllowedNames(const cf::Value& allowed) {
   std::unordered_set<std::string_view> names;
   if (const cf::Array* a = allowed.AsArray()) {
     for (const cf::Value& v : *a)
-      if (const std::string* s = v.AsString()) names.insert(*s);
+      if (const cf::String* s = v.AsString()) names.insert(s->view());
   } else if (const cf::Dictionary* d = allowed.AsDictionary()) {
     for (const auto& [k, v] : *d)
-      if (const std::string* s = k.AsString()) names.insert(*s);
+      if (const cf::String* s = k.AsString()) names.insert(s->view());
   }
   return names;
 }
@@ -75,10 +75,19 @@ cf::Dictionary CreateDictFromCxt(const GenericParserCxt& context, const cf::Valu
   if (context.pairs.empty()) return out;
   const bool filtered = !allowed.IsNull();
   const auto names = filtered ? AllowedNames(allowed) : std::unordered_set<std::string_view>();
-  out.Reserve(context.pairs.size());
+  // Every name is copied once, into one block the keys share.
+  size_t count = 0, characters = 0;
   for (const ParserPair& pair : context.pairs) {
     if (filtered && !names.count(pair.name)) continue;
-    out.Set(cf::Value(pair.name), cf::Value::UInt64(pair.value));  // the one copy of the name
+    ++count;
+    characters += pair.name.size();
+  }
+  cf::StringBlock block(count, characters);
+  out.Reserve(count);
+  for (const ParserPair& pair : context.pairs) {
+    if (filtered && !names.count(pair.name)) continue;
+    // A later pair of the same name replaces the value and keeps the place.
+    out.Set(block.Make(pair.name), cf::Value::UInt64(pair.value));
   }
   return out;
 }

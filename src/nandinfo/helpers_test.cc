@@ -70,6 +70,31 @@ TEST(HelpersTest, Dictionaries) {
   ASSERT_EQ(d.size(), 1u);
   EXPECT_EQ(d.Get("b"), cf::Value::UInt64(2));
 
+  // Long names, repeated: the first place, the last value, and keys that
+  // outlive the context they were read from.
+  const std::string long_a(60, 'a'), long_b(98, 'b');
+  ReleaseGenericParserCxt(&c);
+  AddSingleValueToGenericContext(&c, "prefix_", long_a.c_str(), 1);
+  AddSingleValueToGenericContext(&c, "", long_b.c_str(), 2);
+  AddSingleValueToGenericContext(&c, "", "s", 3);
+  AddSingleValueToGenericContext(&c, "prefix_", long_a.c_str(), 4);
+  AddSingleValueToGenericContext(&c, "", long_b.c_str(), 5);
+  d = CreateDictFromCxt(c);
+  const cf::Dictionary filtered =
+      CreateDictFromCxt(c, cf::Array({cf::Value(long_b), cf::Value("s"), cf::Value("prefix_")}));
+  ReleaseGenericParserCxt(&c);
+  ASSERT_EQ(d.size(), 3u);
+  EXPECT_EQ(d.entries()[0].first, cf::Value("prefix_" + long_a));
+  EXPECT_EQ(d.entries()[0].second, cf::Value::UInt64(4));
+  EXPECT_EQ(d.entries()[1].first, cf::Value(long_b));
+  EXPECT_EQ(d.entries()[1].second, cf::Value::UInt64(5));
+  EXPECT_EQ(d.entries()[2].first, cf::Value("s"));
+  EXPECT_EQ(d.Get(cf::Value("prefix_" + long_a)), cf::Value::UInt64(4));
+  ASSERT_EQ(filtered.size(), 2u);
+  EXPECT_EQ(filtered.entries()[0].first, cf::Value(long_b));
+  EXPECT_EQ(filtered.entries()[0].second, cf::Value::UInt64(5));
+  EXPECT_EQ(filtered.Get(cf::Value("s")), cf::Value::UInt64(3));
+
   cf::Dictionary source;
   source.Set("x", cf::Value::SInt64(123456));
   source.Set("y", "text");

@@ -18,10 +18,10 @@ bool platform::AnalyticsAvailable() { return Context::Current().analytics_availa
 bool AnalyticsIsEventUsed(std::string_view event) {
   if (!platform::AnalyticsAvailable()) return false;
   const cf::Value enabled = platform::ReadProfileValue("/var/eventlens/enabled-events.plist");
-  if (const std::string* s = enabled.AsString()) return *s == "*";
+  if (const cf::String* s = enabled.AsString()) return *s == "*";
   if (const cf::Array* names = enabled.AsArray())
     for (const cf::Value& name : *names)
-      if (const std::string* n = name.AsString(); n && (*n == "*" || *n == event)) return true;
+      if (const cf::String* n = name.AsString(); n && (*n == "*" || *n == event)) return true;
   return false;
 }
 

@@ -165,7 +165,7 @@ std::string FirstLineOf(const char* path) {
 // A non-empty string answer, else the host's file, else "unknown".
 std::string AnswerOrHostFact(std::string_view question, const char* host_path, std::string* source) {
   const cf::Value answer = DVCopyAnswer(question);
-  if (const std::string* s = answer.AsString(); s && !s->empty()) {
+  if (const cf::String* s = answer.AsString(); s && !s->empty()) {
     *source = "answers";
     return *s;
   }

@@ -121,7 +121,7 @@ class HostDiskClient : public sim::UserClient {
  public:
   explicit HostDiskClient(const sim::Service& service)
       : tunnel_method_(service.class_name == "VSPStorage" ? 8 : 9) {
-    if (const std::string* d = service.properties.Get("device").AsString()) device_ = *d;
+    if (const cf::String* d = service.properties.Get("device").AsString()) device_ = *d;
   }
 
   sim::kern_return_t CallMethod(sim::MethodCall& call) override {
@@ -168,7 +168,7 @@ std::unique_ptr<sim::UserClient> CreateHostDiskClient(const sim::Service& servic
 }
 
 bool AttachHostDisk(sim::Service& service, std::string* why) {
-  const std::string* device = service.properties.Get("device").AsString();
+  const cf::String* device = service.properties.Get("device").AsString();
   if (!device) {
     *why = "a host disk needs \"device\" (a path under /dev) among its properties; left out";
     return false;

@@ -458,7 +458,7 @@ int64_t xpc_dictionary_get_int64(const cf::Value& message, std::string_view key)
   return v->AsNumber()->AsSInt64();
 }
 
-const std::string* xpc_dictionary_get_string(const cf::Value& message, std::string_view key) {
+const cf::String* xpc_dictionary_get_string(const cf::Value& message, std::string_view key) {
   const cf::Dictionary* d = message.AsDictionary();
   if (!d) return nullptr;
   const cf::Value* v = d->Find(std::string(key));

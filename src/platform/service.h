@@ -106,7 +106,7 @@ int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled);
 
 // Message readers; a missing or mistyped int64 reads as 0.
 int64_t xpc_dictionary_get_int64(const cf::Value& message, std::string_view key);
-const std::string* xpc_dictionary_get_string(const cf::Value& message, std::string_view key);
+const cf::String* xpc_dictionary_get_string(const cf::Value& message, std::string_view key);
 std::optional<std::array<uint8_t, 16>> xpc_dictionary_get_uuid(const cf::Value& message, std::string_view key);
 cf::Value xpc_dictionary_get_value(const cf::Value& message, std::string_view key);
 // The hyphenated 8-4-4-4-12 text of a UUID, in upper case.

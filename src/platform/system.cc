@@ -143,7 +143,7 @@ int Sysctl(const char* name, void* buffer, size_t* size) {
     return Fail(ENOMEM);
   }
   if (const cf::Data* d = v.AsData()) return CopyOut(d->data(), d->size(), buffer, size);
-  if (const std::string* text = v.AsString()) return CopyOut(text->c_str(), text->size() + 1, buffer, size);
+  if (const cf::String* text = v.AsString()) return CopyOut(text->c_str(), text->size() + 1, buffer, size);
   if (!v.IsNull()) return Fail(EINVAL);
 
   const std::string key = name;
@@ -243,7 +243,7 @@ cf::Array systemLanguages() {
 
 cf::Array preferredLocalizationsFromArray(const cf::Array& available, const cf::Array& preferences) {
   for (const cf::Value& pref : preferences) {
-    const std::string* p = pref.AsString();
+    const cf::String* p = pref.AsString();
     if (!p) continue;
     for (const cf::Value& a : available)
       if (a.AsString() && *a.AsString() == *p) return cf::Array({a});

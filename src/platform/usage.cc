@@ -109,7 +109,7 @@ void UsageFeed::UsageToDateFor(const std::set<std::string>& names, UsageNameKind
     cf::Array named;
     for (const cf::Value& record : answer->records) {
       const cf::Dictionary* r = record.AsDictionary();
-      const std::string* name = r && kind == kUsageProcessProcName ? r->Get("procName").AsString() : nullptr;
+      const cf::String* name = r && kind == kUsageProcessProcName ? r->Get("procName").AsString() : nullptr;
       if (name && names.count(*name)) named.Append(record);
     }
     answer->records = named;

@@ -51,7 +51,7 @@ std::unique_ptr<TBConfig> TBConfig::init() {
     return config;
   }
   for (const auto& [name_value, group_value] : *root) {
-    const std::string* name = name_value.AsString();
+    const cf::String* name = name_value.AsString();
     if (!name) {
       LogError("Whitelist group name %@ is not a string; ignoring the group", name_value);
       continue;
@@ -75,7 +75,7 @@ std::unique_ptr<TBConfig> TBConfig::init() {
 
 void TBConfig::LoadGroup(const std::string& group_name, const cf::Dictionary& group) {
   for (const auto& [section_name, section_value] : group) {
-    const std::string* section = section_name.AsString();
+    const cf::String* section = section_name.AsString();
     cf::Dictionary* table = nullptr;
     if (!section) continue;
     if (*section == "ScalarKeys") table = &_scalarKeys;

@@ -24,7 +24,7 @@ bool Fail(std::string* error, std::string text) {
 // A name of 1 to 63 characters without NUL: longer ones would lose their
 // terminator in the padded field, and a NUL would cut the name short.
 bool CheckName(const cf::Value& value, const std::string& where, std::string* error) {
-  const std::string* name = value.AsString();
+  const cf::String* name = value.AsString();
   if (!name) {
     const std::string what = value.IsNull() ? "missing" : cf::TypeNameWithArticle(value.type());
     return Fail(error, where + ": \"name\" must be a string, not " + what);

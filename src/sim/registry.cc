@@ -23,7 +23,7 @@ std::optional<uint64_t> EntryID(const cf::Value& v) {
 bool ReadService(const cf::Value& entry, size_t index, Service* out, std::string* error) {
   const cf::Dictionary* d = entry.AsDictionary();
   if (!d) return Fail(error, index, "not a dictionary");
-  const std::string* class_name = d->Get("class").AsString();
+  const cf::String* class_name = d->Get("class").AsString();
   if (!class_name || class_name->empty()) return Fail(error, index, "\"class\" must be a non-empty string");
   out->class_name = *class_name;
   const cf::Value& name = d->Get("name");

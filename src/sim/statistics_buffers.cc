@@ -131,7 +131,7 @@ bool FieldValues(const cf::Value& name, const cf::Value& value, uint64_t max_val
 
 template <typename Fields>
 auto FindByName(const Fields& table, const cf::Value& name) -> decltype(&table[0]) {
-  if (const std::string* text = name.AsString())
+  if (const cf::String* text = name.AsString())
     for (const auto& row : table)
       if (*text == row.name) return &row;
   return nullptr;

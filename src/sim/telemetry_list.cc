@@ -40,7 +40,7 @@ bool Word(const cf::Value& value, const std::string& where, uint32_t* out, std::
 
 // "0" to "1023", written without leading zeros so that one word has one name.
 bool WordIndex(const cf::Value& key, size_t* index) {
-  const std::string* text = key.AsString();
+  const cf::String* text = key.AsString();
   if (!text || text->empty() || text->size() > 4 || ((*text)[0] == '0' && text->size() > 1)) return false;
   size_t v = 0;
   for (char c : *text) {
@@ -56,7 +56,7 @@ bool EncodeBus(const cf::Value& bus, size_t b, std::string& block, std::string& 
   const cf::Dictionary* fields = bus.AsDictionary();
   if (!fields) return Fail(error, where + ": expected a dictionary, not " + cf::TypeNameWithArticle(bus.type()));
   for (const auto& [key, value] : *fields) {
-    const std::string* name = key.AsString();
+    const cf::String* name = key.AsString();
     if (name && *name == "words") {
       const cf::Dictionary* words = value.AsDictionary();
       if (!words)
@@ -88,7 +88,7 @@ bool EncodeBus(const cf::Value& bus, size_t b, std::string& block, std::string& 
 std::optional<std::string> EncodeTelemetryList(const cf::Dictionary& fields, std::string* error) {
   const cf::Array* buses = nullptr;
   for (const auto& [key, value] : fields) {
-    const std::string* name = key.AsString();
+    const cf::String* name = key.AsString();
     if (!name || *name != "buses") {
       Fail(error, "unknown telemetry key \"" + key.Description() + "\"");
       return std::nullopt;

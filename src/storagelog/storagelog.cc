@@ -336,7 +336,7 @@ void NLW_WriteLog(std::string_view bug_type, const cf::Value& values) {
 
 std::string GetFaultkeepKey() {
   const cf::Value answer = DVCopyAnswer("InverseDeviceID");
-  return answer.AsString() ? *answer.AsString() : "error";
+  return answer.AsString() ? answer.AsString()->str() : "error";
 }
 
 namespace storagelog::testing {

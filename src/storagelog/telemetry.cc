@@ -65,13 +65,13 @@ Parser ParserFor(ChipKind chip, uint64_t nand_key) {
 }
 
 // The text of a string entry, or null after saying why there is none.
-const std::string* StringEntry(const cf::Dictionary& characteristics, const char* key) {
+const cf::String* StringEntry(const cf::Dictionary& characteristics, const char* key) {
   const cf::Value* v = characteristics.Find(cf::Value(key));
   if (!v || v->IsNull()) {
     std::fprintf(stderr, "ERROR: Could not determine the %s\n", key);
     return nullptr;
   }
-  const std::string* text = v->AsString();
+  const cf::String* text = v->AsString();
   if (!text) std::fprintf(stderr, "ERROR: %s is not stored as a CFStringTypeID\n", key);
   return text;
 }
@@ -111,7 +111,7 @@ bool ParseTelemetryList(const uint8_t* data, size_t size, const cf::Value& chara
   }
 
   // The chip's name must fit a 64-byte C buffer with its terminator.
-  const std::string* chip_id = StringEntry(*chars, "chip-id");
+  const cf::String* chip_id = StringEntry(*chars, "chip-id");
   if (!chip_id) return false;
   if (chip_id->size() >= kChipIdBytes) {
     std::fprintf(stderr,
@@ -123,7 +123,7 @@ bool ParseTelemetryList(const uint8_t* data, size_t size, const cf::Value& chara
   const ChipKind chip = *chip_id == "K3R" ? ChipKind::kK3R : *chip_id == "K4R" ? ChipKind::kK4R : ChipKind::kOther;
 
   // The part's id is read as C text; one holding a NUL byte has none.
-  const std::string* manufacturer_id = StringEntry(*chars, "manufacturer-id");
+  const cf::String* manufacturer_id = StringEntry(*chars, "manufacturer-id");
   if (!manufacturer_id) return false;
   if (manufacturer_id->find('\0') != std::string::npos) {
     std::fprintf(stderr, "ERROR: %s is NULL\n", "manufacturer-id");
