@@ -26,8 +26,14 @@ class CrashWalkTest : public ::testing::Test {
  protected:
   static void SetUpTestSuite() {
     templ_ = new TempDir;
-    const RunResult init = RunProgram(DEVSIM_BIN, {"init", templ_->path() + "/root"}, Env(templ_->path() + "/root"));
+    const std::string root = templ_->path() + "/root";
+    const RunResult init = RunProgram(DEVSIM_BIN, {"init", root}, Env(root));
     ASSERT_EQ(init.status, 0) << init.err;
+    // One analytics event in use keeps the event appends in the walk; the
+    // storage views' forty more would only multiply the same kind of point.
+    std::string enabled;
+    ASSERT_TRUE(cf::WriteXMLPropertyList(cf::Array({cf::Value("com.velmora.homedeck.appInstalls")}), enabled, nullptr));
+    ASSERT_TRUE(platform::WriteFileAtomically(root + "/var/eventlens/enabled-events.plist", enabled));
   }
   static void TearDownTestSuite() {
     delete templ_;
