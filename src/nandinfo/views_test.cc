@@ -4,6 +4,7 @@
 
 #include <thread>
 
+#include "../../tests/records.h"
 #include "../../tests/temp_dir.h"
 #include "../../tests/test_values.h"
 #include "cf/plist.h"
@@ -53,14 +54,8 @@ class ViewsTest : public ::testing::Test {
   // (event, payload) of every event sent so far.
   std::vector<std::pair<std::string, cf::Dictionary>> Sent() {
     std::vector<std::pair<std::string, cf::Dictionary>> out;
-    const std::string text = platform::ReadFile(root / "var/eventlens/events.jsonl").value_or("");
-    for (size_t start = 0; start < text.size();) {
-      const size_t end = text.find('\n', start);
-      const cf::Value line = cf::ParseJSON(text.substr(start, end - start)).value;
-      start = end + 1;
-      const cf::Dictionary* d = line.AsDictionary();
-      if (d) out.emplace_back(*d->Get("event").AsString(), *d->Get("payload").AsDictionary());
-    }
+    for (const cf::Dictionary& d : JSONLines(root / "var/eventlens/events.jsonl"))
+      out.emplace_back(*d.Get("event").AsString(), *d.Get("payload").AsDictionary());
     return out;
   }
 };

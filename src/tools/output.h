@@ -33,6 +33,9 @@ inline std::string RealText(double d) {
   return ec == std::errc() ? std::string(buf, end) : std::string("nan");
 }
 
+// A real as JSON: its shortest text, or null for the non-finite ones JSON lacks.
+inline std::string JSONReal(double d) { return std::isfinite(d) ? RealText(d) : "null"; }
+
 inline std::string JSONString(const std::string& s) {
   // Bytes that are not UTF-8 become U+FFFD rather than invalid JSON.
   return nlohmann::json(s).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
@@ -54,7 +57,7 @@ inline void AppendJSON(const cf::Value& v, int indent, int depth, std::string& o
     case cf::Type::kBoolean: out += *v.AsBool() ? "true" : "false"; return;
     case cf::Type::kNumber: {
       const cf::Number& n = *v.AsNumber();
-      if (n.IsFloat()) out += std::isfinite(n.AsFloat64()) ? RealText(n.AsFloat64()) : "null";
+      if (n.IsFloat()) out += JSONReal(n.AsFloat64());
       else if (n.IsUnsigned()) out += std::to_string(n.AsUInt64());
       else out += std::to_string(n.AsSInt64());
       return;

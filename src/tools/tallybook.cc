@@ -67,7 +67,6 @@ std::string JSONHead(int32_t day, const std::string& key) {
          tools::JSONString(key);
 }
 
-std::string JSONReal(double d) { return std::isfinite(d) ? tools::RealText(d) : "null"; }
 
 int Dump(bool one_day, int64_t day, const std::string& prefix, bool json) {
   auto history = OpenHistory();
@@ -96,8 +95,8 @@ int Dump(bool one_day, int64_t day, const std::string& prefix, bool json) {
                    }
                    if (json)
                      std::printf("%s,\"count\":%llu,\"min\":%s,\"max\":%s,\"mean\":%s}\n", JSONHead(d, key).c_str(),
-                                 static_cast<unsigned long long>(n), JSONReal(mn).c_str(), JSONReal(mx).c_str(),
-                                 JSONReal(mean).c_str());
+                                 static_cast<unsigned long long>(n), tools::JSONReal(mn).c_str(),
+                                 tools::JSONReal(mx).c_str(), tools::JSONReal(mean).c_str());
                    else
                      std::printf("%d %s %llu %s %s %s\n", d, key.c_str(), static_cast<unsigned long long>(n),
                                  tools::RealText(mn).c_str(), tools::RealText(mx).c_str(),
