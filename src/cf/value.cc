@@ -1,5 +1,7 @@
 #include "cf/value.h"
 
+#include "cf/bytes.h"
+
 #include <algorithm>
 #include <cctype>
 #include <cmath>
@@ -55,34 +57,42 @@ uint64_t Load4(const char* p) {
   std::memcpy(&w, p, 4);
   return w;
 }
-uint64_t Fold(uint64_t x) {
-  x ^= x >> 31;
-  x *= 0xbf58476d1ce4e5b9ULL;
-  return x ^ (x >> 29);
+// The two halves of a 128-bit product folded together: every bit of both
+// factors reaches the low bits the index uses.
+inline uint64_t MulFold(uint64_t a, uint64_t b) {
+  const unsigned __int128 r = static_cast<unsigned __int128>(a) * b;
+  return static_cast<uint64_t>(r) ^ static_cast<uint64_t>(r >> 64);
 }
 
-// Two lanes of 8-byte words, each folded by a multiply; the last words may
-// overlap the ones before. Names of a few dozen characters take a few
-// multiplies.
-uint32_t HashBytes(const char* p, size_t n) {
-  uint64_t a = 0x9e3779b97f4a7c15ULL ^ n, b = 0xc2b2ae3d27d4eb4fULL;
-  while (n > 16) {
-    a = Fold(a ^ Load8(p));
-    b = Fold(b ^ Load8(p + 8));
-    p += 16;
-    n -= 16;
-  }
-  if (n > 8) {
-    a ^= Load8(p);
-    b ^= Load8(p + n - 8);
+// Sixteen bytes at a time through one wide multiply; the last sixteen (or
+// all of a shorter text) are read as two words that may overlap, which
+// with the length mixed in tells every text apart before the multiply.
+// Names of a few dozen characters take two or three multiplies, one after
+// the other.
+inline uint32_t HashBytes(const char* p, size_t n) {
+  constexpr uint64_t k0 = 0x9e3779b97f4a7c15ULL, k1 = 0xc2b2ae3d27d4eb4fULL, k2 = 0x165667b19e3779f9ULL;
+  uint64_t seed = k0 ^ n, a = 0, b = 0;
+  if (n > 16) {
+    size_t left = n;
+    while (left > 16) {
+      seed = MulFold(Load8(p) ^ k1, Load8(p + 8) ^ seed);
+      p += 16;
+      left -= 16;
+    }
+    a = Load8(p + left - 16);
+    b = Load8(p + left - 8);
+  } else if (n >= 8) {
+    a = Load8(p);
+    b = Load8(p + n - 8);
   } else if (n >= 4) {
-    a ^= Load4(p) | Load4(p + n - 4) << 32;
+    a = Load4(p);
+    b = Load4(p + n - 4);
   } else if (n > 0) {
-    a ^= static_cast<uint64_t>(static_cast<unsigned char>(p[0])) |
-         static_cast<uint64_t>(static_cast<unsigned char>(p[n / 2])) << 8 |
-         static_cast<uint64_t>(static_cast<unsigned char>(p[n - 1])) << 16;
+    a = static_cast<uint64_t>(static_cast<unsigned char>(p[0])) |
+        static_cast<uint64_t>(static_cast<unsigned char>(p[n / 2])) << 8 |
+        static_cast<uint64_t>(static_cast<unsigned char>(p[n - 1])) << 16;
   }
-  const uint64_t h = Fold(Fold(a) ^ b);
+  const uint64_t h = MulFold(a ^ k2, b ^ seed);
   return static_cast<uint32_t>(h ^ (h >> 32));
 }
 
@@ -93,25 +103,18 @@ internal::TextBlock* NewTextBlock(size_t characters, size_t references) {
 
 char* TextOf(internal::TextBlock* block) { return reinterpret_cast<char*>(block + 1); }
 
-// The 16 bytes of a string's representation, written with one store: the
-// caller moves the new string at once, and a 16-byte load of bytes that
-// narrower stores have just written waits for them to reach the cache.
-using Words = uint64_t __attribute__((vector_size(16)));
-template <typename Rep>
-void StoreRep(Rep& rep, Words words) {
-  static_assert(sizeof(Rep) == sizeof(Words));
-  std::memcpy(&rep, &words, sizeof words);
-}
+using internal::StoreRep;
+using internal::Words;
 
 // Up to 15 characters and the zeros after them, as two little-endian words
 // read from the text without reading past it.
 Words LocalWords(const char* p, size_t n) {
   uint64_t lo = 0, hi = 0;
-  if (n > 8) {
+  if (n >= 8) {
+    // The last word read holds characters 8 and on in its top n - 8 bytes;
+    // shifting in two steps makes n == 8 give zero.
     lo = Load8(p);
-    hi = Load8(p + n - 8) >> (8 * (16 - n));
-  } else if (n == 8) {
-    lo = Load8(p);
+    hi = Load8(p + n - 8) >> (8 * (15 - n)) >> 8;
   } else if (n >= 4) {
     lo = Load4(p) | Load4(p + n - 4) << (8 * (n - 4));
   } else {
@@ -132,8 +135,7 @@ size_t String::HashOfEmpty() {
 
 String::String(std::string_view text) {
   if (text.size() > std::numeric_limits<uint32_t>::max()) throw std::length_error("cf::String too long");
-  size_ = static_cast<uint32_t>(text.size());
-  hash_ = HashBytes(text.data(), text.size());
+  SetHead(text.size(), HashBytes(text.data(), text.size()));
   if (!IsShared()) {
     StoreRep(rep_, LocalWords(text.data(), text.size()));
     return;
@@ -143,6 +145,11 @@ String::String(std::string_view text) {
   std::memcpy(out, text.data(), text.size());
   out[text.size()] = 0;
   StoreRep(rep_, Words{reinterpret_cast<uintptr_t>(block), reinterpret_cast<uintptr_t>(out)});
+}
+
+[[gnu::always_inline]] inline String::String(Short, std::string_view text, size_t hash) noexcept {
+  SetHead(text.size(), hash);
+  StoreRep(rep_, LocalWords(text.data(), text.size()));
 }
 
 void String::Release(internal::TextBlock* block, size_t n) noexcept {
@@ -198,13 +205,6 @@ Number Number::MakeDouble(NumberType type, double v) {
   } else {
     n.bits_ = LowBits(type, SaturatingTruncate<int64_t>(v));
   }
-  return n;
-}
-
-Number Number::UInt64(uint64_t v) {
-  Number n;
-  n.type_ = NumberType::kUInt64;
-  n.bits_ = v;
   return n;
 }
 
@@ -289,7 +289,7 @@ class ArrayImpl {
 class DictionaryImpl {
  public:
   std::vector<std::pair<Value, Value>> entries;
-  std::vector<size_t> hashes;
+  std::vector<uint32_t> hashes;  // of the keys, folded to 32 bits by IndexHash
   // Open-addressing index into entries (slot value = index + 1); built only
   // once the dictionary is large enough for a linear scan to hurt.
   std::vector<uint32_t> slots;
@@ -300,27 +300,36 @@ class DictionaryImpl {
   DictionaryImpl(const DictionaryImpl&) = default;
   DictionaryImpl& operator=(const DictionaryImpl&) = default;
   // Gives back the references of keys made in the same block one run at a
-  // time instead of one atomic step per key.
+  // time instead of one atomic step per key. The keys are left null, so the
+  // entries then go without a call each.
   ~DictionaryImpl() {
     internal::TextBlock* run = nullptr;
     size_t n = 0;
     for (auto& entry : entries) {
-      String* key = std::get_if<String>(&entry.first.v_);
-      if (!key || !key->IsShared()) continue;
-      if (key->rep_.shared.block != run) {
-        if (run) String::Release(run, n);
-        run = key->rep_.shared.block;
-        n = 0;
+      if (entry.first.type_ != Type::kString) continue;
+      String& key = entry.first.u_.string;
+      if (key.IsShared()) {
+        if (key.rep_.shared.block != run) {
+          if (run) String::Release(run, n);
+          run = key.rep_.shared.block;
+          n = 0;
+        }
+        ++n;
       }
-      ++n;
-      key->ForgetBlock();
+      // Nothing is left to give back: the string can end without its destructor.
+      entry.first.type_ = Type::kNull;
     }
     if (run) String::Release(run, n);
   }
 
   // Where key is (index into entries), or -1 and, when indexed, the free
   // slot where it would go.
-  long FindIndex(const Value& key, size_t h, size_t* free_slot = nullptr) const {
+  static uint32_t IndexHash(const Value& key) {
+    const size_t h = key.Hash();
+    return static_cast<uint32_t>(h ^ (h >> 32));
+  }
+
+  long FindIndex(const Value& key, uint32_t h, size_t* free_slot = nullptr) const {
     if (slots.empty()) {
       for (size_t i = 0; i < entries.size(); ++i)
         if (hashes[i] == h && entries[i].first == key) return static_cast<long>(i);
@@ -337,7 +346,7 @@ class DictionaryImpl {
       if (hashes[i] == h && entries[i].first == key) return static_cast<long>(i);
     }
   }
-  long FindIndex(const Value& key) const { return FindIndex(key, key.Hash()); }
+  long FindIndex(const Value& key) const { return FindIndex(key, IndexHash(key)); }
 
   void Insert(size_t i) {
     const size_t mask = slots.size() - 1;
@@ -358,7 +367,7 @@ class DictionaryImpl {
 
   // Appends a new key with hash h; free_slot, when known, is where its
   // probe ended.
-  void Append(Value&& key, Value&& value, size_t h, const size_t* free_slot = nullptr) {
+  void Append(Value&& key, Value&& value, uint32_t h, const size_t* free_slot = nullptr) {
     hashes.push_back(h);
     entries.emplace_back(std::move(key), std::move(value));
     if (slots.empty()) {
@@ -409,7 +418,7 @@ const Value& Dictionary::Get(const Value& key) const {
   return v ? *v : kNull;
 }
 void Dictionary::Set(Value key, Value value) {
-  const size_t h = key.Hash();
+  const uint32_t h = DictionaryImpl::IndexHash(key);
   size_t free_slot = 0;
   const long i = impl_->FindIndex(key, h, &free_slot);
   if (i >= 0) {
@@ -419,7 +428,7 @@ void Dictionary::Set(Value key, Value value) {
   impl_->Append(std::move(key), std::move(value), h, impl_->slots.empty() ? nullptr : &free_slot);
 }
 void Dictionary::AppendUnique(Value key, Value value) {
-  const size_t h = key.Hash();
+  const uint32_t h = DictionaryImpl::IndexHash(key);
   impl_->Append(std::move(key), std::move(value), h);
 }
 void Dictionary::Remove(const Value& key) {
@@ -446,6 +455,89 @@ std::vector<std::pair<Value, Value>>::const_iterator Dictionary::begin() const {
 std::vector<std::pair<Value, Value>>::const_iterator Dictionary::end() const {
   return impl_->entries.end();
 }
+Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
+  Dictionary out;
+  if (count == 0) return out;
+  DictionaryImpl& d = *out.impl_;
+  size_t capacity = 16;
+  while (capacity < count * 2) capacity <<= 1;
+  d.slots.assign(capacity, 0);
+  // Sized for every pair at once and cut to the entries kept at the end:
+  // writing through a pointer spares each entry the checks of an append.
+  d.hashes.resize(count);
+  d.entries.resize(count);
+  std::pair<Value, Value>* const entries = d.entries.data();
+  uint32_t* const hashes = d.hashes.data();
+  size_t kept = 0;
+  // The long names go into blocks that start at an estimate and double;
+  // a block learns how many keys hold it once it is full or the last.
+  internal::TextBlock* block = nullptr;
+  char *cursor = nullptr, *block_end = nullptr;
+  size_t block_size = count * 16 + 256, block_keys = 0;
+  auto close_block = [&] {
+    if (block) block->references.store(block_keys, std::memory_order_relaxed);
+  };
+  uint32_t* const slots = d.slots.data();
+  const size_t mask = capacity - 1;
+  // The entries and the index in one pass. Each name is hashed a few
+  // names ahead of its turn and its slot asked for then, so that the hash
+  // and the slot's wait overlap the work on the names before it; a
+  // repeated name only replaces a value.
+  constexpr size_t kAhead = 8;  // a power of two
+  uint32_t ahead[kAhead];
+  auto look_ahead = [&](size_t i) {
+    const std::string_view name = pairs[i].name;
+    const uint32_t h = HashBytes(name.data(), name.size());
+    ahead[i % kAhead] = h;
+    __builtin_prefetch(&slots[h & mask]);
+  };
+  for (size_t i = 0; i < count && i < kAhead; ++i) look_ahead(i);
+  for (size_t i = 0; i < count; ++i) {
+    const uint32_t h = ahead[i % kAhead];
+    if (i + kAhead < count) look_ahead(i + kAhead);
+    const std::string_view name = pairs[i].name;
+    size_t s = h & mask;
+    bool repeated = false;
+    for (uint32_t slot; (slot = slots[s]) != 0; s = (s + 1) & mask) {
+      const size_t j = slot - 1;
+      if (hashes[j] == h && entries[j].first.StringView() == name) {
+        entries[j].second = Value(Number::UInt64(pairs[i].value));
+        repeated = true;
+        break;
+      }
+    }
+    if (repeated) continue;
+    slots[s] = static_cast<uint32_t>(kept + 1);
+    hashes[kept] = h;
+    // The key's parts go straight into the new entry.
+    auto& entry = entries[kept++];
+    new (&entry.second) Value(Number::UInt64(pairs[i].value));
+    if (name.size() > String::kLocalCapacity) {
+      if (static_cast<size_t>(block_end - cursor) <= name.size()) {
+        close_block();  // first: the keys made so far hold it whatever happens next
+        if (name.size() > std::numeric_limits<uint32_t>::max()) throw std::length_error("cf::String too long");
+        block_size = std::max(block ? block_size * 2 : block_size, name.size() + 1);
+        block = NewTextBlock(block_size, 0);
+        block_keys = 0;
+        cursor = TextOf(block);
+        block_end = cursor + block_size;
+      }
+      CopyShort(cursor, name.data(), name.size());
+      cursor[name.size()] = 0;
+      new (entry.first.StartString()) String(block, cursor, name.size(), h);
+      cursor += name.size() + 1;
+      ++block_keys;
+    } else {
+      new (entry.first.StartString()) String(String::Short(), name, h);
+    }
+  }
+  close_block();
+  d.entries.resize(kept);
+  d.hashes.resize(kept);
+  if (kept < DictionaryImpl::kIndexThreshold) d.slots.clear();
+  return out;
+}
+
 Dictionary Dictionary::MutableCopy() const {
   Dictionary d;
   *d.impl_ = *impl_;
@@ -473,9 +565,25 @@ std::string TypeNameWithArticle(Type t) {
   return (t == Type::kArray ? "an " : "a ") + name;
 }
 
-const Data* Value::AsData() const {
-  auto p = std::get_if<std::shared_ptr<const Data>>(&v_);
-  return p ? p->get() : nullptr;
+void Value::CopyFrom(const Value& o) {
+  switch (o.type_) {
+    case Type::kString: new (&u_.string) String(o.u_.string); break;
+    case Type::kData: new (&u_.data) std::shared_ptr<const Data>(o.u_.data); break;
+    case Type::kArray: new (&u_.array) Array(o.u_.array); break;
+    case Type::kDictionary: new (&u_.dictionary) Dictionary(o.u_.dictionary); break;
+    default: std::memcpy(static_cast<void*>(&u_), &o.u_, sizeof u_); break;
+  }
+  type_ = o.type_;
+}
+
+void Value::Destroy() noexcept {
+  switch (type_) {
+    case Type::kString: u_.string.~String(); break;
+    case Type::kData: u_.data.~shared_ptr(); break;
+    case Type::kArray: u_.array.~Array(); break;
+    case Type::kDictionary: u_.dictionary.~Dictionary(); break;
+    default: break;
+  }
 }
 
 bool Value::operator==(const Value& o) const {

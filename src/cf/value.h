@@ -22,7 +22,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
-#include <variant>
+#include <new>
 #include <vector>
 
 namespace cf {
@@ -55,7 +55,12 @@ class Number {
   static Number SInt16(int16_t v) { return Make(NumberType::kSInt16, v); }
   static Number SInt32(int32_t v) { return Make(NumberType::kSInt32, v); }
   static Number SInt64(int64_t v) { return Make(NumberType::kSInt64, v); }
-  static Number UInt64(uint64_t v);
+  static Number UInt64(uint64_t v) {
+    Number n;
+    n.type_ = NumberType::kUInt64;
+    n.bits_ = v;
+    return n;
+  }
   static Number Float32(float v) { return MakeDouble(NumberType::kFloat32, v); }
   static Number Float64(double v) { return MakeDouble(NumberType::kFloat64, v); }
 
@@ -103,6 +108,16 @@ namespace internal {
 struct TextBlock {
   std::atomic<size_t> references;
 };
+
+// The 16 bytes of a string's representation, written with one store: a new
+// string is usually moved at once, and a 16-byte load of bytes that narrower
+// stores have just written waits for them to reach the cache.
+using Words = uint64_t __attribute__((vector_size(16)));
+template <typename Rep>
+inline void StoreRep(Rep& rep, Words words) {
+  static_assert(sizeof(Rep) == sizeof(Words));
+  std::memcpy(&rep, &words, sizeof words);
+}
 }  // namespace internal
 
 // An immutable string. Up to 15 characters are held inline; longer texts
@@ -112,14 +127,17 @@ struct TextBlock {
 // never change.
 class String {
  public:
-  String() noexcept : size_(0), hash_(HashOfEmpty()) { rep_.local[0] = 0; }
+  String() noexcept {
+    SetHead(0, HashOfEmpty());
+    rep_.local[0] = 0;
+  }
   explicit String(std::string_view text);
   explicit String(const char* text) : String(std::string_view(text)) {}
   explicit String(const std::string& text) : String(std::string_view(text)) {}
-  String(const String& o) noexcept : size_(o.size_), hash_(o.hash_), rep_(o.rep_) {
+  String(const String& o) noexcept : head_(o.head_), rep_(o.rep_) {
     if (IsShared()) rep_.shared.block->references.fetch_add(1, std::memory_order_relaxed);
   }
-  String(String&& o) noexcept : size_(o.size_), hash_(o.hash_), rep_(o.rep_) { o.ForgetBlock(); }
+  String(String&& o) noexcept : head_(o.head_), rep_(o.rep_) { o.ForgetBlock(); }
   String& operator=(const String& o) noexcept {
     String copy(o);
     Swap(copy);
@@ -136,19 +154,19 @@ class String {
 
   const char* data() const { return IsShared() ? rep_.shared.data : rep_.local; }
   const char* c_str() const { return data(); }
-  size_t size() const { return size_; }
-  size_t length() const { return size_; }
-  bool empty() const { return size_ == 0; }
-  std::string_view view() const { return {data(), size_}; }
+  size_t size() const { return head_.size; }
+  size_t length() const { return head_.size; }
+  bool empty() const { return head_.size == 0; }
+  std::string_view view() const { return {data(), head_.size}; }
   std::string str() const { return std::string(view()); }
   operator std::string_view() const { return view(); }
   operator std::string() const { return str(); }
-  size_t hash() const { return hash_; }
+  size_t hash() const { return head_.hash; }
   // Reading as a std::string would.
   static constexpr size_t npos = std::string_view::npos;
   char operator[](size_t i) const { return data()[i]; }
   const char* begin() const { return data(); }
-  const char* end() const { return data() + size_; }
+  const char* end() const { return data() + head_.size; }
   size_t find(std::string_view s, size_t pos = 0) const { return view().find(s, pos); }
   size_t find(char c, size_t pos = 0) const { return view().find(c, pos); }
   size_t rfind(std::string_view s, size_t pos = npos) const { return view().rfind(s, pos); }
@@ -163,8 +181,8 @@ class String {
   }
 
   friend bool operator==(const String& a, const String& b) {
-    if (a.size_ != b.size_ || a.hash_ != b.hash_) return false;
-    return a.data() == b.data() || std::memcmp(a.data(), b.data(), a.size_) == 0;
+    if (a.head_.size != b.head_.size || a.head_.hash != b.head_.hash) return false;
+    return a.data() == b.data() || std::memcmp(a.data(), b.data(), a.head_.size) == 0;
   }
   friend bool operator==(const String& a, std::string_view b) { return a.view() == b; }
   friend bool operator==(const String& a, const char* b) { return a.view() == std::string_view(b); }
@@ -179,32 +197,46 @@ class String {
  private:
   friend class StringBlock;
   friend class DictionaryImpl;
+  friend class Dictionary;
   static constexpr size_t kLocalCapacity = 15;  // plus the NUL
 
-  bool IsShared() const { return size_ > kLocalCapacity; }
+  bool IsShared() const { return head_.size > kLocalCapacity; }
   // A long text already copied from text to data, whose reference on block
   // the new string takes over. Hashes the original: reading back bytes just
   // stored waits for the stores.
   String(internal::TextBlock* block, const char* data, std::string_view text) noexcept
-      : size_(static_cast<uint32_t>(text.size())), hash_(static_cast<uint32_t>(HashOf(text))) {
-    rep_.shared.block = block;
-    rep_.shared.data = data;
+      : String(block, data, text.size(), HashOf(text)) {}
+  // The same, with the hash already known.
+  String(internal::TextBlock* block, const char* data, size_t size, size_t hash) noexcept
+{
+    SetHead(size, hash);
+    internal::StoreRep(rep_, internal::Words{reinterpret_cast<uintptr_t>(block), reinterpret_cast<uintptr_t>(data)});
   }
+  // A short text (kLocalCapacity characters at most) whose hash is known.
+  struct Short {};
+  String(Short, std::string_view text, size_t hash) noexcept;
   static size_t HashOfEmpty();
   // Leaves this an empty string without giving back its reference.
   void ForgetBlock() noexcept {
-    size_ = 0;
+    head_.size = 0;
     rep_.local[0] = 0;
   }
   void Swap(String& o) noexcept {
-    std::swap(size_, o.size_);
-    std::swap(hash_, o.hash_);
+    std::swap(head_, o.head_);
     std::swap(rep_, o.rep_);
   }
   static void Release(internal::TextBlock* block, size_t n) noexcept;
 
-  uint32_t size_;
-  uint32_t hash_;
+  // Size and hash are written together, by SetHead: copies read them as one
+  // word, and a word read of two narrower stores waits for both.
+  struct Head {
+    uint32_t size;
+    uint32_t hash;
+  } head_;
+  void SetHead(size_t size, size_t hash) noexcept {
+    const uint64_t word = static_cast<uint32_t>(size) | static_cast<uint64_t>(static_cast<uint32_t>(hash)) << 32;
+    std::memcpy(&head_, &word, sizeof word);
+  }
   union Rep {
     struct {
       internal::TextBlock* block;
@@ -271,6 +303,12 @@ class Array {
   std::shared_ptr<ArrayImpl> impl_;
 };
 
+// A name and an unsigned 64-bit value: one entry of a bulk-built dictionary.
+struct NamedUnsigned {
+  std::string_view name;
+  uint64_t value;
+};
+
 // Shared handle to a mutable dictionary that keeps insertion order. Keys are
 // any value; replacing a key's value keeps its place.
 class Dictionary {
@@ -296,6 +334,12 @@ class Dictionary {
   Dictionary MutableCopy() const;
   bool SameAs(const Dictionary& o) const { return impl_ == o.impl_; }
 
+  // The dictionary Set would leave, called with each pair in order on an
+  // empty one: string keys, unsigned 64-bit numbers, a later name replacing
+  // the earlier value in its place. Built in passes rather than pair by
+  // pair, with every key's characters in one shared block.
+  static Dictionary OfUnsigned(const NamedUnsigned* pairs, size_t count);
+
  private:
   friend class Value;
   std::shared_ptr<DictionaryImpl> impl_;
@@ -311,24 +355,26 @@ std::string TypeNameWithArticle(Type t);
 
 class Value {
  public:
-  Value() = default;
-  Value(std::nullptr_t) {}
-  Value(Number n) : v_(n) {}
-  Value(const char* s) : v_(String(s)) {}
-  Value(const std::string& s) : v_(String(s)) {}
-  Value(std::string_view s) : v_(String(s)) {}
-  Value(String s) : v_(std::move(s)) {}
-  Value(Date d) : v_(d) {}
-  Value(Array a) : v_(std::move(a)) {}
-  Value(Dictionary d) : v_(std::move(d)) {}
+  Value() noexcept {}
+  Value(std::nullptr_t) noexcept {}
+  Value(Number n) noexcept : type_(Type::kNumber) { new (&u_.number) Number(n); }
+  Value(const char* s) : Value(String(s)) {}
+  Value(const std::string& s) : Value(String(s)) {}
+  Value(std::string_view s) : Value(String(s)) {}
+  Value(String s) noexcept : type_(Type::kString) { new (&u_.string) String(std::move(s)); }
+  Value(Date d) noexcept : type_(Type::kDate) { new (&u_.date) Date(d); }
+  Value(Array a) noexcept : type_(Type::kArray) { new (&u_.array) Array(std::move(a)); }
+  Value(Dictionary d) noexcept : type_(Type::kDictionary) { new (&u_.dictionary) Dictionary(std::move(d)); }
   static Value Bool(bool b) {
     Value v;
-    v.v_ = b;
+    v.type_ = Type::kBoolean;
+    v.u_.boolean = b;
     return v;
   }
   static Value Bytes(Data d) {
     Value v;
-    v.v_ = std::make_shared<const Data>(std::move(d));
+    new (&v.u_.data) std::shared_ptr<const Data>(std::make_shared<const Data>(std::move(d)));
+    v.type_ = Type::kData;
     return v;
   }
   static Value SInt32(int32_t v) { return Number::SInt32(v); }
@@ -336,23 +382,44 @@ class Value {
   static Value UInt64(uint64_t v) { return Number::UInt64(v); }
   static Value Float64(double v) { return Number::Float64(v); }
 
-  Type type() const { return static_cast<Type>(v_.index()); }
-  bool IsNull() const { return type() == Type::kNull; }
+  Value(const Value& o) { CopyFrom(o); }
+  Value(Value&& o) noexcept { MoveFrom(o); }
+  Value& operator=(const Value& o) {
+    if (this != &o) {
+      Value copy(o);
+      Reset();
+      MoveFrom(copy);
+    }
+    return *this;
+  }
+  Value& operator=(Value&& o) noexcept {
+    if (this != &o) {
+      Reset();
+      MoveFrom(o);
+    }
+    return *this;
+  }
+  ~Value() {
+    if (!IsPlain(type_)) Destroy();
+  }
+
+  Type type() const { return type_; }
+  bool IsNull() const { return type_ == Type::kNull; }
   explicit operator bool() const { return !IsNull(); }
 
   // Borrowed views; null when the value has another type.
-  const bool* AsBool() const { return std::get_if<bool>(&v_); }
-  const Number* AsNumber() const { return std::get_if<Number>(&v_); }
-  const String* AsString() const { return std::get_if<String>(&v_); }
+  const bool* AsBool() const { return type_ == Type::kBoolean ? &u_.boolean : nullptr; }
+  const Number* AsNumber() const { return type_ == Type::kNumber ? &u_.number : nullptr; }
+  const String* AsString() const { return type_ == Type::kString ? &u_.string : nullptr; }
   // The characters of a string; empty for other types.
   std::string_view StringView() const {
     const String* s = AsString();
     return s ? s->view() : std::string_view();
   }
-  const Data* AsData() const;
-  const Date* AsDate() const { return std::get_if<Date>(&v_); }
-  const Array* AsArray() const { return std::get_if<Array>(&v_); }
-  const Dictionary* AsDictionary() const { return std::get_if<Dictionary>(&v_); }
+  const Data* AsData() const { return type_ == Type::kData ? u_.data.get() : nullptr; }
+  const Date* AsDate() const { return type_ == Type::kDate ? &u_.date : nullptr; }
+  const Array* AsArray() const { return type_ == Type::kArray ? &u_.array : nullptr; }
+  const Dictionary* AsDictionary() const { return type_ == Type::kDictionary ? &u_.dictionary : nullptr; }
 
   bool operator==(const Value& o) const;
   bool operator!=(const Value& o) const { return !(*this == o); }
@@ -367,9 +434,51 @@ class Value {
   Value DeepCopy() const;
 
  private:
+  friend class Dictionary;
   friend class DictionaryImpl;
-  std::variant<std::monostate, bool, Number, String, std::shared_ptr<const Data>, Date, Array, Dictionary>
-      v_;
+
+  // Kinds with nothing to give back: copied and dropped as plain bytes.
+  static constexpr bool IsPlain(Type t) {
+    constexpr unsigned kPlain = 1u << static_cast<int>(Type::kNull) | 1u << static_cast<int>(Type::kBoolean) |
+                                1u << static_cast<int>(Type::kNumber) | 1u << static_cast<int>(Type::kDate);
+    return kPlain >> static_cast<int>(t) & 1;
+  }
+  // A string built in place, for builders that make the string's parts
+  // themselves.
+  String* StartString() {
+    type_ = Type::kString;
+    return &u_.string;
+  }
+  void CopyFrom(const Value& o);
+  // Takes what o holds; o keeps a moved-from value of its kind.
+  void MoveFrom(Value& o) noexcept {
+    switch (o.type_) {
+      case Type::kString: new (&u_.string) String(std::move(o.u_.string)); break;
+      case Type::kData: new (&u_.data) std::shared_ptr<const Data>(std::move(o.u_.data)); break;
+      case Type::kArray: new (&u_.array) Array(std::move(o.u_.array)); break;
+      case Type::kDictionary: new (&u_.dictionary) Dictionary(std::move(o.u_.dictionary)); break;
+      default: std::memcpy(static_cast<void*>(&u_), &o.u_, sizeof u_); break;
+    }
+    type_ = o.type_;
+  }
+  void Reset() noexcept {
+    if (!IsPlain(type_)) Destroy();
+    type_ = Type::kNull;
+  }
+  void Destroy() noexcept;
+
+  Type type_ = Type::kNull;
+  union Storage {
+    Storage() {}
+    ~Storage() {}
+    bool boolean;
+    Number number;
+    String string;
+    std::shared_ptr<const Data> data;
+    Date date;
+    Array array;
+    Dictionary dictionary;
+  } u_;
 };
 
 struct ValueHash {

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cmath>
 #include <limits>
 #include <string>
@@ -265,6 +266,95 @@ TEST(StringTest, DictionariesOfSharedKeysGiveBackEveryReference) {
   EXPECT_EQ(copy.Get(Value(name('a', 19))), Value::SInt32(19));
   copy.Clear();
   EXPECT_EQ(kept_a.StringView(), name('a', 0));
+}
+
+// A dictionary built at once is the one Set makes pair by pair: the same
+// entries in the same order, a repeated name replacing the value in the
+// first one's place, every key found, and keys that outlive it.
+TEST(DictionaryTest, BuiltAtOnceIsWhatSetMakes) {
+  for (size_t count : {0, 1, 11, 12, 13, 5000}) {
+    SCOPED_TRACE(count);
+    std::vector<std::string> names;
+    std::vector<NamedUnsigned> pairs;
+    for (size_t i = 0; i < count; ++i) {
+      // Short, just inline, just shared and very long names (more
+      // characters than the first text block is sized for), and every
+      // seventh name a repeat of an earlier one.
+      if (i % 7 == 6) {
+        names.push_back(names[i / 2]);
+        continue;
+      }
+      const size_t length = std::vector<size_t>{3, 15, 16, 17, 40, 300}[i % 6];
+      std::string name = std::to_string(i) + "_";
+      name.resize(std::max(length, name.size()), static_cast<char>('a' + i % 26));
+      names.push_back(name);
+    }
+    for (size_t i = 0; i < count; ++i) pairs.push_back({names[i], i * 1000 + 1});
+    Dictionary expected;
+    for (const NamedUnsigned& p : pairs) expected.Set(Value(p.name), Value::UInt64(p.value));
+    Value kept;
+    {
+      const Dictionary built = Dictionary::OfUnsigned(pairs.data(), pairs.size());
+      ASSERT_EQ(built.size(), expected.size());
+      for (size_t i = 0; i < built.size(); ++i) {
+        EXPECT_EQ(built.entries()[i].first, expected.entries()[i].first) << i;
+        ASSERT_NE(built.entries()[i].second.AsNumber(), nullptr);
+        EXPECT_EQ(built.entries()[i].second.AsNumber()->type(), NumberType::kUInt64);
+        EXPECT_EQ(built.entries()[i].second, expected.entries()[i].second) << i;
+        const String& key = *built.entries()[i].first.AsString();
+        EXPECT_EQ(key.c_str()[key.size()], '\0');
+      }
+      for (const std::string& name : names) EXPECT_EQ(built.Get(Value(name)), expected.Get(Value(name))) << name;
+      EXPECT_FALSE(built.Contains(Value("absent")));
+      if (count > 0) kept = built.entries().back().first;
+      // Growing it afterwards works as for any dictionary.
+      Dictionary grown = built;
+      grown.Set(Value("added"), Value::SInt32(1));
+      EXPECT_EQ(grown.Get(Value("added")), Value::SInt32(1));
+      if (count > 0) {
+        EXPECT_EQ(grown.Get(Value(names[0])), Value::UInt64(1));
+      }
+    }
+    if (count > 0) {
+      EXPECT_EQ(kept, expected.entries().back().first);
+    }
+  }
+}
+
+// A value changes kind by assignment, copy or move, and gives back what it
+// held each time (the sanitizer build counts every reference).
+TEST(ValueTest, EveryKindAssignsOverEveryKind) {
+  Dictionary d;
+  d.Set("k", Value::SInt32(1));
+  Array a;
+  a.Append(Value("element"));
+  const std::vector<Value> kinds = {Value(),
+                                    Value::Bool(true),
+                                    Value::UInt64(18446744073709551615ull),
+                                    Value("short"),
+                                    Value(std::string(40, 'l')),
+                                    Value::Bytes({1, 2, 3}),
+                                    Value(Date{86400}),
+                                    Value(a),
+                                    Value(d)};
+  for (const Value& from : kinds) {
+    for (const Value& to : kinds) {
+      Value copy = from;
+      copy = to;
+      EXPECT_EQ(copy, to);
+      EXPECT_EQ(copy.type(), to.type());
+      Value moved = from;
+      Value source = to;
+      moved = std::move(source);
+      EXPECT_EQ(moved, to);
+      Value constructed(std::move(moved));
+      EXPECT_EQ(constructed, to);
+      constructed = constructed;  // assigning a value to itself keeps it
+      EXPECT_EQ(constructed, to);
+    }
+  }
+  EXPECT_EQ(kinds[7].AsArray()->at(0), Value("element"));
+  EXPECT_EQ(kinds[8].AsDictionary()->Get("k"), Value::SInt32(1));
 }
 
 TEST(ValueTest, Description) {

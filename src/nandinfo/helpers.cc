@@ -71,25 +71,12 @@ cf::Value NumberOfType(const void* value, int type) {
 }  // namespace
 
 cf::Dictionary CreateDictFromCxt(const GenericParserCxt& context, const cf::Value& allowed) {
-  cf::Dictionary out;
-  if (context.pairs.empty()) return out;
-  const bool filtered = !allowed.IsNull();
-  const auto names = filtered ? AllowedNames(allowed) : std::unordered_set<std::string_view>();
-  // Every name is copied once, into one block the keys share.
-  size_t count = 0, characters = 0;
-  for (const ParserPair& pair : context.pairs) {
-    if (filtered && !names.count(pair.name)) continue;
-    ++count;
-    characters += pair.name.size();
-  }
-  cf::StringBlock block(count, characters);
-  out.Reserve(count);
-  for (const ParserPair& pair : context.pairs) {
-    if (filtered && !names.count(pair.name)) continue;
-    // A later pair of the same name replaces the value and keeps the place.
-    out.Set(block.Make(pair.name), cf::Value::UInt64(pair.value));
-  }
-  return out;
+  if (allowed.IsNull()) return cf::Dictionary::OfUnsigned(context.pairs.data(), context.pairs.size());
+  const auto names = AllowedNames(allowed);
+  std::vector<ParserPair> kept;
+  for (const ParserPair& pair : context.pairs)
+    if (names.count(pair.name)) kept.push_back(pair);
+  return cf::Dictionary::OfUnsigned(kept.data(), kept.size());
 }
 
 cf::Value CreateFilteredDict(const cf::Value& dictionary, const cf::Value& allowed) {

@@ -6,6 +6,8 @@
 #include <new>
 #include <utility>
 
+#include "cf/bytes.h"
+
 namespace parsers::testing {
 int64_t g_adds_before_failure = -1;
 }
@@ -67,31 +69,15 @@ std::string ParserPairValueText(const ParserPair& pair) {
 namespace {
 
 // The test hook's stand-in for an exhausted heap: throws where an
-// allocation would.
-inline void ChargeOneAdd() {
+// allocation would, after the adds the budget still allows.
+inline void ChargeAdds(int64_t n) {
   int64_t& budget = parsers::testing::g_adds_before_failure;
-  if (budget == 0) throw std::bad_alloc();
-  if (budget > 0) --budget;
-}
-
-// Copies a name. A general block move costs more to start than copying a
-// name of a few dozen characters takes; up to four overlapping moves from
-// both ends do that without a loop.
-inline void CopyShort(char* out, const char* in, size_t n) {
-  auto move = [&](size_t at, size_t width) { std::memcpy(out + at, in + at, width); };
-  if (n > 64) {
-    std::memcpy(out, in, n);
-  } else if (n > 32) {
-    move(0, 16), move(16, 16), move(n - 32, 16), move(n - 16, 16);
-  } else if (n > 16) {
-    move(0, 16), move(n - 16, 16);
-  } else if (n >= 8) {
-    move(0, 8), move(n - 8, 8);
-  } else if (n >= 4) {
-    move(0, 4), move(n - 4, 4);
-  } else if (n > 0) {
-    move(0, 1), move(n / 2, 1), move(n - 1, 1);
+  if (budget < 0) return;
+  if (budget < n) {
+    budget = 0;
+    throw std::bad_alloc();
   }
+  budget -= n;
 }
 
 // An element's elementSize bytes as the low-order bytes of a 64-bit zero
@@ -112,56 +98,108 @@ inline uint64_t Element(const uint8_t* p, uint32_t size) {
   return v;
 }
 
-// Appends the pair whose name was just written at the arena's room, then
-// keeps the name; nothing is kept when the pair cannot be added.
-inline void AppendPair(GenericParserCxt& context, const char* name, size_t length, uint64_t value) {
-  context.pairs.push_back({std::string_view(name, length), value});
-  context.names.Commit(length);
+// Room for n more pairs, growing by doubling: contexts filled by many small
+// adds do not copy their pairs each time.
+inline void ReserveMore(std::vector<ParserPair>& pairs, size_t n) {
+  if (pairs.capacity() - pairs.size() < n) pairs.reserve(std::max(pairs.size() + n, pairs.capacity() * 2));
 }
 
-}  // namespace
-
-int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix, const char* name, uint64_t value) {
-  if (!context) return 0;
+// Appends (prefix + name, cut to 98 characters; value).
+int AddJoined(GenericParserCxt& context, std::string_view prefix, std::string_view name, uint64_t value) {
   try {
-    ChargeOneAdd();
-    const size_t prefix_length = prefix && *prefix ? std::min(std::strlen(prefix), kMaxParserNameLength) : 0;
-    const size_t name_length = name ? std::min(std::strlen(name), kMaxParserNameLength - prefix_length) : 0;
-    char* out = context->names.Room(prefix_length + name_length);
-    CopyShort(out, prefix, prefix_length);
-    CopyShort(out + prefix_length, name, name_length);
-    AppendPair(*context, out, prefix_length + name_length, value);
+    ChargeAdds(1);
+    prefix = prefix.substr(0, kMaxParserNameLength);
+    name = name.substr(0, kMaxParserNameLength - prefix.size());
+    ReserveMore(context.pairs, 1);
+    char* out = context.names.Room(prefix.size() + name.size());
+    cf::CopyShort(out, prefix.data(), prefix.size());
+    cf::CopyShort(out + prefix.size(), name.data(), name.size());
+    ParserPair& pair = context.pairs.emplace_back();
+    pair.name = std::string_view(out, prefix.size() + name.size());
+    pair.value = value;
+    context.names.Commit(prefix.size() + name.size());
   } catch (const std::bad_alloc&) {
     return 0;
   }
   return 1;
 }
 
+}  // namespace
+
+int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix, const char* name, uint64_t value) {
+  if (!context) return 0;
+  return AddJoined(*context, prefix ? std::string_view(prefix) : std::string_view(),
+                   name ? std::string_view(name) : std::string_view(), value);
+}
+
+int AddNamedValue(GenericParserCxt& context, std::string_view name, uint64_t value) {
+  // Most adds find room for the pair and its name at hand; the rest, and
+  // every add while the test hook counts, take the general path.
+  name = name.substr(0, kMaxParserNameLength);
+  char* out = context.names.RoomAtHand(name.size());
+  if (!out || context.pairs.size() == context.pairs.capacity() || parsers::testing::g_adds_before_failure >= 0)
+    return AddJoined(context, {}, name, value);
+  cf::CopyShort(out, name.data(), name.size());
+  ParserPair& pair = context.pairs.emplace_back();
+  pair.name = std::string_view(out, name.size());
+  pair.value = value;
+  context.names.Commit(name.size());
+  return 1;
+}
+
 int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* name, const void* source,
                                       uint32_t elementSize, uint32_t count) {
   if (elementSize == 0 || count == 0) return 1;
+  if (!context) return 0;
+  return AddNamedArray(*context, name ? std::string_view(name) : std::string_view(), source, elementSize, count);
+}
+
+int AddNamedArray(GenericParserCxt& context, std::string_view name, const void* source, uint32_t elementSize,
+                  uint32_t count) {
+  if (elementSize == 0 || count == 0) return 1;
   if (elementSize > 8 || !source || count > kMaxParserArrayElements) return 0;
   const auto* bytes = static_cast<const uint8_t*>(source);
-  if (count == 1) return AddSingleValueToGenericContext(context, "", name, Element(bytes, elementSize));
-  if (!context) return 0;
-  constexpr size_t kIndexDigits = 5;  // 65535 at most
-  const size_t name_length = name ? std::min(std::strlen(name), kMaxParserNameLength) : 0;
+  if (count == 1) return AddNamedValue(context, name, Element(bytes, elementSize));
+  name = name.substr(0, kMaxParserNameLength);
   // All or nothing: a failure takes back the pairs and names this call added.
-  const size_t before = context->pairs.size();
-  const ParserNameArena::Mark mark = context->names.Position();
+  const size_t before = context.pairs.size();
+  const ParserNameArena::Mark mark = context.names.Position();
   try {
-    context->pairs.reserve(before + count);
+    ChargeAdds(count);
+    ReserveMore(context.pairs, count);
+    context.pairs.resize(before + count);
+    ParserPair* pair = context.pairs.data() + before;
+    // Room for every name at once, each with up to five digits, and for the
+    // eight bytes the last one's digits are written with.
+    constexpr size_t kIndexDigits = 5;  // 65535 at most
+    char* const start = context.names.Room((name.size() + kIndexDigits) * count + 8);
+    char* out = start;
+    // The index as text, first digit in the low byte, counted up in a
+    // register rather than printed each time.
+    uint64_t digits = '0';
+    size_t digit_count = 1;
     for (uint32_t i = 0; i < count; ++i) {
-      ChargeOneAdd();
-      char* out = context->names.Room(name_length + kIndexDigits);
-      CopyShort(out, name, name_length);
-      const char* end = std::to_chars(out + name_length, out + name_length + kIndexDigits, i).ptr;
-      AppendPair(*context, out, std::min<size_t>(end - out, kMaxParserNameLength),
-                 Element(bytes + static_cast<size_t>(i) * elementSize, elementSize));
+      cf::CopyShort(out, name.data(), name.size());
+      std::memcpy(out + name.size(), &digits, sizeof digits);
+      const size_t length = std::min(name.size() + digit_count, kMaxParserNameLength);
+      pair[i].name = std::string_view(out, length);
+      pair[i].value = Element(bytes + static_cast<size_t>(i) * elementSize, elementSize);
+      out += length;
+      size_t k = digit_count;
+      for (; k > 0; --k) {
+        const uint64_t unit = uint64_t{1} << (8 * (k - 1));
+        if ((digits >> (8 * (k - 1)) & 0xff) != '9') {
+          digits += unit;
+          break;
+        }
+        digits -= 9 * unit;  // a 9 turns 0 and carries
+      }
+      if (k == 0) digits = digits << 8 | '1', ++digit_count;
     }
+    context.names.Commit(static_cast<size_t>(out - start));
   } catch (const std::bad_alloc&) {
-    context->pairs.erase(context->pairs.begin() + static_cast<ptrdiff_t>(before), context->pairs.end());
-    context->names.Rewind(mark);
+    context.pairs.erase(context.pairs.begin() + static_cast<ptrdiff_t>(before), context.pairs.end());
+    context.names.Rewind(mark);
     return 0;
   }
   return 1;

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "cf/format.h"
+#include "cf/value.h"
 
 // The characters of a context's names, written one after another into
 // blocks that never move, so the views its pairs hold stay valid while it
@@ -26,6 +27,8 @@ class ParserNameArena {
   // At least n writable characters; throws std::bad_alloc. What is written
   // there belongs to the arena only once committed.
   char* Room(size_t n) { return left_ >= n ? cursor_ : NewBlock(n); }
+  // The same, or null where that would take a new block.
+  char* RoomAtHand(size_t n) const { return left_ >= n ? cursor_ : nullptr; }
   void Commit(size_t n) {
     cursor_ += n;
     left_ -= n;
@@ -51,12 +54,10 @@ class ParserNameArena {
   size_t next_block_size_ = kFirstBlockSize;
 };
 
-// One pair. Names are at most 98 characters and live in the context's name
-// arena; names repeat when a key occurs twice in a buffer.
-struct ParserPair {
-  std::string_view name;
-  uint64_t value;
-};
+// One pair (name, value). Names are at most 98 characters and live in the
+// context's name arena; names repeat when a key occurs twice in a buffer.
+// The dictionary's own pair type, so a context's pairs build one as they are.
+using ParserPair = cf::NamedUnsigned;
 
 // The value as the decimal text a context carries beside it ("%llu").
 std::string ParserPairValueText(const ParserPair& pair);
@@ -105,6 +106,11 @@ inline constexpr uint32_t kMaxParserArrayElements = 65536;
 // no memory; a call that fails adds nothing.
 int AddMultipleFieldsToGenericContext(GenericParserCxt* context, const char* name, const void* source,
                                       uint32_t elementSize, uint32_t count);
+// The same two adds for callers that know the lengths of their names, as
+// the parsers' tables do; the context is never null here.
+int AddNamedValue(GenericParserCxt& context, std::string_view name, uint64_t value);
+int AddNamedArray(GenericParserCxt& context, std::string_view name, const void* source, uint32_t elementSize,
+                  uint32_t count);
 // Frees every pair and name and empties the context, which can be filled
 // again; harmless on an empty context.
 void ReleaseGenericParserCxt(GenericParserCxt* context);

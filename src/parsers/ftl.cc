@@ -2,6 +2,7 @@
 #include <bit>
 #include <cstring>
 
+#include "cf/bytes.h"
 #include "parsers/ftl_table.h"
 #include "parsers/parsers.h"
 
@@ -61,7 +62,7 @@ uint32_t VSPFTLParseBufferToCxt(GenericParserCxt* context, const void* buffer, u
     remaining -= length;
     if (const parsers::FtlField* f = parsers::FindFtlField(key)) {
       if (!f->is_array()) {
-        if (!AddSingleValueToGenericContext(context, "", f->name, Word(words, at)))
+        if (!context || !AddNamedValue(*context, f->name_view(), Word(words, at)))
           SetAPIErrorMessage("VSPFTLParseBufferToCxt: %s(%u) cannot add 1 element to context", f->name, f->key);
         ++count;
       } else {
@@ -69,10 +70,14 @@ uint32_t VSPFTLParseBufferToCxt(GenericParserCxt* context, const void* buffer, u
           SetAPIErrorMessage("VSPFTLParseBufferToCxt: %s(%u): (#%u) cfg elements != (%d) buffer elements", f->name,
                              f->key, f->count, static_cast<int32_t>(length));
         const uint32_t n = std::min(length, f->count);
-        const size_t name_length = std::min(std::strlen(f->name), kMaxParserNameLength);
-        std::memcpy(array_name, f->name, name_length);
-        std::memcpy(array_name + name_length, "_", 2);
-        if (!AddMultipleFieldsToGenericContext(context, array_name, words + at * 8, 8, n)) {
+        const size_t name_length = std::min<size_t>(f->length, kMaxParserNameLength);
+        cf::CopyShort(array_name, f->name, name_length);
+        array_name[name_length] = '_';
+        // Without a context only an empty array counts as added.
+        const int added =
+            context ? AddNamedArray(*context, std::string_view(array_name, name_length + 1), words + at * 8, 8, n)
+                    : n == 0;
+        if (!added) {
           SetAPIErrorMessage("VSPFTLParseBufferToCxt: %s(%u): Cannot add %u elements to context", f->name, f->key,
                              f->count);
           return count;
@@ -105,11 +110,11 @@ uint32_t VSPParseBufferToCxt(VSPParseCxt* context, const void* buffer, uint32_t 
     const parsers::FtlField* f = length > 0 ? parsers::FindFtlField(key) : nullptr;
     if (f && !f->is_array()) {
       const uint64_t v = Word(words, at);
-      AddSingleValueToGenericContext(context, "", f->name, v);
+      AddNamedValue(*context, f->name_view(), v);
       StoreFixedField(context, key, v);
     } else if (f) {
       const uint32_t n = std::min(length, f->count);
-      AddMultipleFieldsToGenericContext(context, f->name, words + at * 8, 8, n);
+      AddNamedArray(*context, f->name_view(), words + at * 8, 8, n);
       if (key == 265)
         for (uint32_t i = 0; i < n && i < 5; ++i) context->readCountHisto[i] = Word(words, at + i);
     }

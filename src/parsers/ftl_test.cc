@@ -256,9 +256,10 @@ TEST_F(FtlTest, ArrayAddsAllOrNothing) {
     EXPECT_EQ(c.pairs.size(), 4 + k.added) << k.what;
     if (c.pairs.size() != 4 + k.added) continue;
     EXPECT_EQ(c.pairs[3].name, "pre2") << k.what;
-    if (k.added > 0) {
-      EXPECT_EQ(c.pairs.back().name, "x" + std::to_string(k.added - 1)) << k.what;
-      EXPECT_EQ(c.pairs.back().value, (k.added - 1) * 3) << k.what;
+    // Every index as its decimal text, across each new digit.
+    for (size_t i = 0; i < k.added; ++i) {
+      ASSERT_EQ(c.pairs[4 + i].name, "x" + std::to_string(i)) << k.what;
+      ASSERT_EQ(c.pairs[4 + i].value, i * 3) << k.what;
     }
     // The context goes on from where it was.
     EXPECT_EQ(AddSingleValueToGenericContext(&c, "", "after", 1), 1);

@@ -3,6 +3,8 @@
 
 #include <cstdint>
 #include <span>
+#include <string>
+#include <string_view>
 
 namespace parsers {
 
@@ -10,6 +12,8 @@ struct MspField {
   uint32_t key;
   const char* name;
   uint32_t count;  // 32-bit elements; 1 for a single value
+  uint32_t length = static_cast<uint32_t>(std::char_traits<char>::length(name));  // of the name
+  std::string_view name_view() const { return {name, length}; }
 };
 
 // The row of a record key, or null for a key that carries no field.
