@@ -108,7 +108,7 @@ using internal::Words;
 
 // Up to 15 characters and the zeros after them, as two little-endian words
 // read from the text without reading past it.
-Words LocalWords(const char* p, size_t n) {
+[[gnu::always_inline]] inline Words LocalWords(const char* p, size_t n) {
   uint64_t lo = 0, hi = 0;
   if (n >= 8) {
     // The last word read holds characters 8 and on in its top n - 8 bytes;
@@ -286,41 +286,106 @@ class ArrayImpl {
   std::vector<Value> items;
 };
 
+// A dictionary's entries in one block, like a vector of them, but dropped
+// in a single pass: the references of keys made in the same text block go
+// back one run at a time instead of one atomic step per key, and plain
+// values cost a test each.
+class EntryStore {
+ public:
+  using Entry = std::pair<Value, Value>;
+  EntryStore() = default;
+  EntryStore(const EntryStore& o) { *this = o; }
+  EntryStore& operator=(const EntryStore& o) {
+    if (this == &o) return *this;
+    clear();
+    reserve(o.size_);
+    for (const Entry& e : o) emplace_back(e.first, e.second);
+    return *this;
+  }
+  ~EntryStore() {
+    DropAll();
+    ::operator delete(data_);
+  }
+
+  size_t size() const { return size_; }
+  Entry* data() { return data_; }
+  const Entry* data() const { return data_; }
+  Entry& operator[](size_t i) { return data_[i]; }
+  const Entry& operator[](size_t i) const { return data_[i]; }
+  const Entry* begin() const { return data_; }
+  const Entry* end() const { return data_ + size_; }
+
+  void reserve(size_t n) {
+    if (n <= capacity_) return;
+    auto* moved = static_cast<Entry*>(::operator new(n * sizeof(Entry)));
+    for (size_t i = 0; i < size_; ++i) {
+      new (&moved[i]) Entry(std::move(data_[i]));
+      data_[i].~Entry();
+    }
+    ::operator delete(data_);
+    data_ = moved;
+    capacity_ = n;
+  }
+  // A new entry of two null values, in room reserved before: the caller
+  // makes its parts in place.
+  Entry& AppendReserved() { return *new (&data_[size_++]) Entry(); }
+  template <typename K, typename V>
+  void emplace_back(K&& key, V&& value) {
+    if (size_ == capacity_) reserve(std::max<size_t>(8, capacity_ * 2));
+    new (&data_[size_]) Entry(std::forward<K>(key), std::forward<V>(value));
+    ++size_;
+  }
+  void erase(size_t i) {
+    for (size_t j = i + 1; j < size_; ++j) data_[j - 1] = std::move(data_[j]);
+    data_[--size_].~Entry();
+  }
+  void clear() {
+    DropAll();
+    size_ = 0;
+  }
+
+ private:
+  void DropAll() {
+    internal::TextBlock* run = nullptr;
+    size_t n = 0;
+    Entry* const data = data_;
+    for (size_t i = 0, size = size_; i < size; ++i) {
+      Value& key = data[i].first;
+      if (key.type_ == Type::kString) {
+        // The string ends without its destructor: an inline one holds
+        // nothing, a shared one's reference goes back with its run.
+        const String& text = key.u_.string;
+        if (text.IsShared()) {
+          if (text.rep_.shared.block != run) {
+            if (run) String::Release(run, n);
+            run = text.rep_.shared.block;
+            n = 0;
+          }
+          ++n;
+        }
+      } else if (!Value::IsPlain(key.type_)) {
+        key.Destroy();
+      }
+      Value& value = data[i].second;
+      if (!Value::IsPlain(value.type_)) value.Destroy();
+    }
+    if (run) String::Release(run, n);
+  }
+
+  Entry* data_ = nullptr;
+  size_t size_ = 0;
+  size_t capacity_ = 0;
+};
+
 class DictionaryImpl {
  public:
-  std::vector<std::pair<Value, Value>> entries;
+  EntryStore entries;
   std::vector<uint32_t> hashes;  // of the keys, folded to 32 bits by IndexHash
   // Open-addressing index into entries (slot value = index + 1); built only
   // once the dictionary is large enough for a linear scan to hurt.
   std::vector<uint32_t> slots;
 
   static constexpr size_t kIndexThreshold = 12;
-
-  DictionaryImpl() = default;
-  DictionaryImpl(const DictionaryImpl&) = default;
-  DictionaryImpl& operator=(const DictionaryImpl&) = default;
-  // Gives back the references of keys made in the same block one run at a
-  // time instead of one atomic step per key. The keys are left null, so the
-  // entries then go without a call each.
-  ~DictionaryImpl() {
-    internal::TextBlock* run = nullptr;
-    size_t n = 0;
-    for (auto& entry : entries) {
-      if (entry.first.type_ != Type::kString) continue;
-      String& key = entry.first.u_.string;
-      if (key.IsShared()) {
-        if (key.rep_.shared.block != run) {
-          if (run) String::Release(run, n);
-          run = key.rep_.shared.block;
-          n = 0;
-        }
-        ++n;
-      }
-      // Nothing is left to give back: the string can end without its destructor.
-      entry.first.type_ = Type::kNull;
-    }
-    if (run) String::Release(run, n);
-  }
 
   // Where key is (index into entries), or -1 and, when indexed, the free
   // slot where it would go.
@@ -434,7 +499,7 @@ void Dictionary::AppendUnique(Value key, Value value) {
 void Dictionary::Remove(const Value& key) {
   const long i = impl_->FindIndex(key);
   if (i < 0) return;
-  impl_->entries.erase(impl_->entries.begin() + i);
+  impl_->entries.erase(static_cast<size_t>(i));
   impl_->hashes.erase(impl_->hashes.begin() + i);
   impl_->Rebuild(0);
 }
@@ -448,13 +513,11 @@ void Dictionary::Reserve(size_t n) {
   impl_->hashes.reserve(n);
   if (n >= DictionaryImpl::kIndexThreshold && impl_->slots.size() < n * 2) impl_->Rebuild(n);
 }
-const std::vector<std::pair<Value, Value>>& Dictionary::entries() const { return impl_->entries; }
-std::vector<std::pair<Value, Value>>::const_iterator Dictionary::begin() const {
-  return impl_->entries.begin();
+std::span<const std::pair<Value, Value>> Dictionary::entries() const {
+  return {impl_->entries.begin(), impl_->entries.size()};
 }
-std::vector<std::pair<Value, Value>>::const_iterator Dictionary::end() const {
-  return impl_->entries.end();
-}
+const std::pair<Value, Value>* Dictionary::begin() const { return impl_->entries.begin(); }
+const std::pair<Value, Value>* Dictionary::end() const { return impl_->entries.end(); }
 Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
   Dictionary out;
   if (count == 0) return out;
@@ -465,7 +528,7 @@ Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
   // Sized for every pair at once and cut to the entries kept at the end:
   // writing through a pointer spares each entry the checks of an append.
   d.hashes.resize(count);
-  d.entries.resize(count);
+  d.entries.reserve(count);
   std::pair<Value, Value>* const entries = d.entries.data();
   uint32_t* const hashes = d.hashes.data();
   size_t kept = 0;
@@ -473,7 +536,7 @@ Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
   // a block learns how many keys hold it once it is full or the last.
   internal::TextBlock* block = nullptr;
   char *cursor = nullptr, *block_end = nullptr;
-  size_t block_size = count * 16 + 256, block_keys = 0;
+  size_t block_size = count * 24 + 256, block_keys = 0;
   auto close_block = [&] {
     if (block) block->references.store(block_keys, std::memory_order_relaxed);
   };
@@ -482,12 +545,12 @@ Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
   // The entries and the index in one pass. Each name is hashed a few
   // names ahead of its turn and its slot asked for then, so that the hash
   // and the slot's wait overlap the work on the names before it; a
-  // repeated name only replaces a value.
+  // repeated name only replaces a value, so the hashes close up behind the
+  // entries kept.
   constexpr size_t kAhead = 8;  // a power of two
   uint32_t ahead[kAhead];
   auto look_ahead = [&](size_t i) {
-    const std::string_view name = pairs[i].name;
-    const uint32_t h = HashBytes(name.data(), name.size());
+    const uint32_t h = HashBytes(pairs[i].name.data(), pairs[i].name.size());
     ahead[i % kAhead] = h;
     __builtin_prefetch(&slots[h & mask]);
   };
@@ -510,7 +573,8 @@ Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
     slots[s] = static_cast<uint32_t>(kept + 1);
     hashes[kept] = h;
     // The key's parts go straight into the new entry.
-    auto& entry = entries[kept++];
+    auto& entry = d.entries.AppendReserved();
+    ++kept;
     new (&entry.second) Value(Number::UInt64(pairs[i].value));
     if (name.size() > String::kLocalCapacity) {
       if (static_cast<size_t>(block_end - cursor) <= name.size()) {
@@ -532,7 +596,6 @@ Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
     }
   }
   close_block();
-  d.entries.resize(kept);
   d.hashes.resize(kept);
   if (kept < DictionaryImpl::kIndexThreshold) d.slots.clear();
   return out;

@@ -19,6 +19,7 @@
 #include <iosfwd>
 #include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -101,6 +102,7 @@ struct Date {
 class Value;
 class ArrayImpl;
 class DictionaryImpl;
+class EntryStore;
 class StringBlock;
 
 namespace internal {
@@ -198,6 +200,7 @@ class String {
   friend class StringBlock;
   friend class DictionaryImpl;
   friend class Dictionary;
+  friend class EntryStore;
   static constexpr size_t kLocalCapacity = 15;  // plus the NUL
 
   bool IsShared() const { return head_.size > kLocalCapacity; }
@@ -328,9 +331,10 @@ class Dictionary {
   void Remove(const Value& key);
   void Clear();
   void Reserve(size_t n);
-  const std::vector<std::pair<Value, Value>>& entries() const;
-  std::vector<std::pair<Value, Value>>::const_iterator begin() const;
-  std::vector<std::pair<Value, Value>>::const_iterator end() const;
+  // In insertion order; valid until the dictionary changes.
+  std::span<const std::pair<Value, Value>> entries() const;
+  const std::pair<Value, Value>* begin() const;
+  const std::pair<Value, Value>* end() const;
   Dictionary MutableCopy() const;
   bool SameAs(const Dictionary& o) const { return impl_ == o.impl_; }
 
@@ -436,6 +440,7 @@ class Value {
  private:
   friend class Dictionary;
   friend class DictionaryImpl;
+  friend class EntryStore;
 
   // Kinds with nothing to give back: copied and dropped as plain bytes.
   static constexpr bool IsPlain(Type t) {

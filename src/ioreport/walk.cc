@@ -72,7 +72,8 @@ int walkLevel(cf::Dictionary level, const Walk& walk, cf::Dictionary* copy, int 
     if (!found) return kIOReportIterWalkFailed;
     cf::Dictionary levels = *found;
     cf::Dictionary copied;
-    const auto entries = levels.entries();  // pruning removes entries as it goes
+    // A copy: pruning removes entries as it goes.
+    const std::vector<std::pair<cf::Value, cf::Value>> entries(levels.begin(), levels.end());
     for (const auto& [name, nested] : entries) {
       if (!name.AsString() || !nested.AsDictionary()) continue;
       cf::Dictionary nested_copy;

@@ -98,6 +98,47 @@ inline uint64_t Element(const uint8_t* p, uint32_t size) {
   return v;
 }
 
+// Writes count pairs (name0, name1, ...; the elements) from pair on, their
+// names from out on, each with up to five digits and eight bytes written
+// for them; returns where the names end. kSize, when not 0, is elementSize.
+template <uint32_t kSize>
+char* WriteArrayPairs(ParserPair* pair, char* out, std::string_view name, const uint8_t* bytes, uint32_t elementSize,
+                      uint32_t count) {
+  const uint32_t size = kSize ? kSize : elementSize;
+  // The index as text, first digit in the low byte, counted up in a
+  // register rather than printed each time.
+  uint64_t digits = '0';
+  size_t digit_count = 1;
+  unsigned last_shift = 0;  // of the last digit
+  for (uint32_t i = 0; i < count; ++i) {
+    cf::CopyShort(out, name.data(), name.size());
+    std::memcpy(out + name.size(), &digits, sizeof digits);
+    const size_t length = std::min(name.size() + digit_count, kMaxParserNameLength);
+    pair[i].name = std::string_view(out, length);
+    pair[i].value = Element(bytes + static_cast<size_t>(i) * size, size);
+    out += length;
+    if ((digits >> last_shift & 0xff) != '9') {
+      digits += uint64_t{1} << last_shift;
+      continue;
+    }
+    size_t k = digit_count;
+    for (; k > 0; --k) {
+      const uint64_t unit = uint64_t{1} << (8 * (k - 1));
+      if ((digits >> (8 * (k - 1)) & 0xff) != '9') {
+        digits += unit;
+        break;
+      }
+      digits -= 9 * unit;  // a 9 turns 0 and carries
+    }
+    if (k == 0) {
+      digits = digits << 8 | '1';
+      ++digit_count;
+      last_shift += 8;
+    }
+  }
+  return out;
+}
+
 // Room for n more pairs, growing by doubling: contexts filled by many small
 // adds do not copy their pairs each time.
 inline void ReserveMore(std::vector<ParserPair>& pairs, size_t n) {
@@ -132,7 +173,7 @@ int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix
                    name ? std::string_view(name) : std::string_view(), value);
 }
 
-int AddNamedValue(GenericParserCxt& context, std::string_view name, uint64_t value) {
+[[gnu::flatten]] int AddNamedValue(GenericParserCxt& context, std::string_view name, uint64_t value) {
   // Most adds find room for the pair and its name at hand; the rest, and
   // every add while the test hook counts, take the general path.
   name = name.substr(0, kMaxParserNameLength);
@@ -168,35 +209,18 @@ int AddNamedArray(GenericParserCxt& context, std::string_view name, const void* 
     ChargeAdds(count);
     ReserveMore(context.pairs, count);
     context.pairs.resize(before + count);
-    ParserPair* pair = context.pairs.data() + before;
     // Room for every name at once, each with up to five digits, and for the
     // eight bytes the last one's digits are written with.
     constexpr size_t kIndexDigits = 5;  // 65535 at most
     char* const start = context.names.Room((name.size() + kIndexDigits) * count + 8);
-    char* out = start;
-    // The index as text, first digit in the low byte, counted up in a
-    // register rather than printed each time.
-    uint64_t digits = '0';
-    size_t digit_count = 1;
-    for (uint32_t i = 0; i < count; ++i) {
-      cf::CopyShort(out, name.data(), name.size());
-      std::memcpy(out + name.size(), &digits, sizeof digits);
-      const size_t length = std::min(name.size() + digit_count, kMaxParserNameLength);
-      pair[i].name = std::string_view(out, length);
-      pair[i].value = Element(bytes + static_cast<size_t>(i) * elementSize, elementSize);
-      out += length;
-      size_t k = digit_count;
-      for (; k > 0; --k) {
-        const uint64_t unit = uint64_t{1} << (8 * (k - 1));
-        if ((digits >> (8 * (k - 1)) & 0xff) != '9') {
-          digits += unit;
-          break;
-        }
-        digits -= 9 * unit;  // a 9 turns 0 and carries
-      }
-      if (k == 0) digits = digits << 8 | '1', ++digit_count;
+    ParserPair* const pairs = context.pairs.data() + before;
+    char* end = nullptr;
+    switch (elementSize) {  // the two widths the parsers use, made constants
+      case 8: end = WriteArrayPairs<8>(pairs, start, name, bytes, elementSize, count); break;
+      case 4: end = WriteArrayPairs<4>(pairs, start, name, bytes, elementSize, count); break;
+      default: end = WriteArrayPairs<0>(pairs, start, name, bytes, elementSize, count); break;
     }
-    context.names.Commit(static_cast<size_t>(out - start));
+    context.names.Commit(static_cast<size_t>(end - start));
   } catch (const std::bad_alloc&) {
     context.pairs.erase(context.pairs.begin() + static_cast<ptrdiff_t>(before), context.pairs.end());
     context.names.Rewind(mark);
