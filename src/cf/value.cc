@@ -161,17 +161,6 @@ void String::Release(internal::TextBlock* block, size_t n) noexcept {
 
 std::ostream& operator<<(std::ostream& os, const String& s) { return os << s.view(); }
 
-StringBlock::StringBlock(size_t count, size_t characters) {
-  if (count == 0) return;
-  left_ = characters + count;
-  credits_ = count;
-  block_ = NewTextBlock(left_, count);
-  cursor_ = TextOf(block_);
-}
-
-StringBlock::~StringBlock() {
-  if (credits_) String::Release(block_, credits_);
-}
 
 
 bool Number::IsFloat() const {
@@ -387,13 +376,13 @@ class DictionaryImpl {
 
   static constexpr size_t kIndexThreshold = 12;
 
-  // Where key is (index into entries), or -1 and, when indexed, the free
-  // slot where it would go.
   static uint32_t IndexHash(const Value& key) {
     const size_t h = key.Hash();
     return static_cast<uint32_t>(h ^ (h >> 32));
   }
 
+  // Where key is (index into entries), or -1 and, when indexed, the free
+  // slot where it would go.
   long FindIndex(const Value& key, uint32_t h, size_t* free_slot = nullptr) const {
     if (slots.empty()) {
       for (size_t i = 0; i < entries.size(); ++i)

@@ -103,7 +103,6 @@ class Value;
 class ArrayImpl;
 class DictionaryImpl;
 class EntryStore;
-class StringBlock;
 
 namespace internal {
 // Counted bytes shared by the strings made in them; the characters follow.
@@ -197,21 +196,14 @@ class String {
   static size_t HashOf(std::string_view text);
 
  private:
-  friend class StringBlock;
-  friend class DictionaryImpl;
   friend class Dictionary;
   friend class EntryStore;
   static constexpr size_t kLocalCapacity = 15;  // plus the NUL
 
   bool IsShared() const { return head_.size > kLocalCapacity; }
-  // A long text already copied from text to data, whose reference on block
-  // the new string takes over. Hashes the original: reading back bytes just
-  // stored waits for the stores.
-  String(internal::TextBlock* block, const char* data, std::string_view text) noexcept
-      : String(block, data, text.size(), HashOf(text)) {}
-  // The same, with the hash already known.
-  String(internal::TextBlock* block, const char* data, size_t size, size_t hash) noexcept
-{
+  // A long text of known hash, already copied to data, whose reference on
+  // block the new string takes over.
+  String(internal::TextBlock* block, const char* data, size_t size, size_t hash) noexcept {
     SetHead(size, hash);
     internal::StoreRep(rep_, internal::Words{reinterpret_cast<uintptr_t>(block), reinterpret_cast<uintptr_t>(data)});
   }
@@ -247,38 +239,6 @@ class String {
     } shared;
     char local[kLocalCapacity + 1];
   } rep_;
-};
-
-// Makes many strings in one allocation: for builders that know up front how
-// many strings and characters they will make. Each string made holds its
-// own reference on the block; the block goes when the last one does.
-class StringBlock {
- public:
-  // Room for `count` strings of `characters` characters in all (NULs not
-  // included).
-  StringBlock(size_t count, size_t characters);
-  StringBlock(const StringBlock&) = delete;
-  StringBlock& operator=(const StringBlock&) = delete;
-  ~StringBlock();
-  // A string of text. Beyond the room asked for, strings are made on their
-  // own, as String(text) would make them. Inline, so that the new string's
-  // fields go straight to where the caller keeps it.
-  String Make(std::string_view text) {
-    if (text.size() <= String::kLocalCapacity || credits_ == 0 || text.size() >= left_) return String(text);
-    std::memcpy(cursor_, text.data(), text.size());
-    cursor_[text.size()] = 0;
-    String s(block_, cursor_, text);
-    cursor_ += text.size() + 1;
-    left_ -= text.size() + 1;
-    --credits_;
-    return s;
-  }
-
- private:
-  internal::TextBlock* block_ = nullptr;
-  char* cursor_ = nullptr;
-  size_t left_ = 0;     // characters, NULs included
-  size_t credits_ = 0;  // references taken for strings not made yet
 };
 
 // Shared handle to a mutable array. A default-constructed Array is a new,
@@ -439,7 +399,6 @@ class Value {
 
  private:
   friend class Dictionary;
-  friend class DictionaryImpl;
   friend class EntryStore;
 
   // Kinds with nothing to give back: copied and dropped as plain bytes.

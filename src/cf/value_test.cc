@@ -139,14 +139,24 @@ std::vector<std::string> TextsOfEveryLength() {
   return texts;
 }
 
+// Strings made as a dictionary built at once makes its keys: the long ones
+// share one block. The texts must differ.
+std::vector<String> MadeTogether(const std::vector<std::string>& texts) {
+  std::vector<NamedUnsigned> pairs;
+  for (const std::string& t : texts) pairs.push_back({t, 0});
+  std::vector<String> made;
+  for (const auto& [k, v] : Dictionary::OfUnsigned(pairs.data(), pairs.size())) made.push_back(*k.AsString());
+  return made;
+}
+
 TEST(StringTest, MadeAloneOrInABlockTheTextsAreTheSame) {
   const std::vector<std::string> texts = TextsOfEveryLength();
-  size_t characters = 0;
-  for (const std::string& t : texts) characters += t.size();
-  StringBlock block(texts.size(), characters);
-  for (const std::string& t : texts) {
+  const std::vector<String> made_together = MadeTogether(texts);
+  ASSERT_EQ(made_together.size(), texts.size());
+  for (size_t i = 0; i < texts.size(); ++i) {
+    const std::string& t = texts[i];
     SCOPED_TRACE(t.size());
-    const String alone(t), made = block.Make(t);
+    const String alone(t), made = made_together[i];
     for (const String* s : {&alone, &made}) {
       EXPECT_EQ(s->view(), std::string_view(t));
       EXPECT_EQ(s->size(), t.size());
@@ -195,19 +205,8 @@ TEST(StringTest, EveryCharacterCountsInTheHashAndEquality) {
 
 TEST(StringTest, SharedBytesLiveAsLongAsAnyStringMadeInThem) {
   const std::string long1(40, 'x'), long2(60, 'y');
-  std::vector<String> kept;
-  {
-    StringBlock block(2, long1.size() + long2.size());
-    kept.push_back(block.Make(long1));
-    kept.push_back(block.Make(long2));
-    // Beyond the room asked for: made on its own, still right.
-    const String extra = block.Make(long1);
-    EXPECT_EQ(extra, long1);
-    EXPECT_FALSE(extra.SharesBytesWith(kept[0]));
-  }
-  {
-    StringBlock unused(3, 300);  // credits never used are given back
-  }
+  // The dictionary that made them is gone when they come back.
+  std::vector<String> kept = MadeTogether({long1, long2});
   String copy = kept[0];
   EXPECT_TRUE(copy.SharesBytesWith(kept[0]));
   // Assigning to a copy leaves the shared bytes alone.
@@ -220,8 +219,7 @@ TEST(StringTest, SharedBytesLiveAsLongAsAnyStringMadeInThem) {
   EXPECT_EQ(moved, long2);
 
   // Dropping copies on several threads at once.
-  StringBlock block(1, long1.size());
-  const String shared = block.Make(long1);
+  const String shared = MadeTogether({long1})[0];
   std::vector<std::thread> threads;
   for (int t = 0; t < 4; ++t)
     threads.emplace_back([&shared] {
@@ -239,14 +237,19 @@ TEST(StringTest, DictionariesOfSharedKeysGiveBackEveryReference) {
   // Keys from two blocks, interleaved with inline and ordinary ones; some
   // are kept past the dictionary, one dictionary is copied first.
   const auto name = [](char c, int i) { return std::string(30, c) + std::to_string(i); };
-  StringBlock a(20, 20 * 32), b(20, 20 * 32);
+  std::vector<std::string> names_a, names_b;
+  for (int i = 0; i < 20; ++i) {
+    names_a.push_back(name('a', i));
+    names_b.push_back(name('b', i));
+  }
+  const std::vector<String> a = MadeTogether(names_a), b = MadeTogether(names_b);
   Value kept_a, kept_b;
   Dictionary copy;
   {
     Dictionary d;
     for (int i = 0; i < 20; ++i) {
-      d.Set(a.Make(name('a', i)), Value::SInt32(i));
-      d.Set(b.Make(name('b', i)), Value::SInt32(100 + i));
+      d.Set(a[static_cast<size_t>(i)], Value::SInt32(i));
+      d.Set(b[static_cast<size_t>(i)], Value::SInt32(100 + i));
       d.Set(Value("short" + std::to_string(i)), Value::SInt32(200 + i));
       d.Set(Value(name('c', i)), Value::SInt32(300 + i));
     }
