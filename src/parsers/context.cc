@@ -145,6 +145,15 @@ inline void ReserveMore(std::vector<ParserPair>& pairs, size_t n) {
   if (pairs.capacity() - pairs.size() < n) pairs.reserve(std::max(pairs.size() + n, pairs.capacity() * 2));
 }
 
+// Appends the pair whose name of n characters was just written at out (the
+// arena's room, with a free pair in the vector), then keeps the name.
+inline void AppendPair(GenericParserCxt& context, const char* out, size_t n, uint64_t value) {
+  ParserPair& pair = context.pairs.emplace_back();
+  pair.name = std::string_view(out, n);
+  pair.value = value;
+  context.names.Commit(n);
+}
+
 // Appends (prefix + name, cut to 98 characters; value).
 int AddJoined(GenericParserCxt& context, std::string_view prefix, std::string_view name, uint64_t value) {
   try {
@@ -155,10 +164,7 @@ int AddJoined(GenericParserCxt& context, std::string_view prefix, std::string_vi
     char* out = context.names.Room(prefix.size() + name.size());
     cf::CopyShort(out, prefix.data(), prefix.size());
     cf::CopyShort(out + prefix.size(), name.data(), name.size());
-    ParserPair& pair = context.pairs.emplace_back();
-    pair.name = std::string_view(out, prefix.size() + name.size());
-    pair.value = value;
-    context.names.Commit(prefix.size() + name.size());
+    AppendPair(context, out, prefix.size() + name.size(), value);
   } catch (const std::bad_alloc&) {
     return 0;
   }
@@ -181,10 +187,7 @@ int AddSingleValueToGenericContext(GenericParserCxt* context, const char* prefix
   if (!out || context.pairs.size() == context.pairs.capacity() || parsers::testing::g_adds_before_failure >= 0)
     return AddJoined(context, {}, name, value);
   cf::CopyShort(out, name.data(), name.size());
-  ParserPair& pair = context.pairs.emplace_back();
-  pair.name = std::string_view(out, name.size());
-  pair.value = value;
-  context.names.Commit(name.size());
+  AppendPair(context, out, name.size(), value);
   return 1;
 }
 
