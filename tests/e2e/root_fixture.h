@@ -29,6 +29,18 @@ inline cf::Value ReadPlist(const std::string& path) {
   return cf::ParsePropertyList(*bytes).value;
 }
 
+// Waits up to `seconds` for the child to end, then kills it; its wait status
+// goes to status. True when it ended on its own.
+inline bool WaitOrKill(pid_t pid, int seconds, int* status) {
+  for (int i = 0; i < seconds * 100; ++i) {
+    if (waitpid(pid, status, WNOHANG) != 0) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  kill(pid, SIGKILL);
+  waitpid(pid, status, 0);
+  return false;
+}
+
 class RootTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -90,12 +102,7 @@ class RootTest : public ::testing::Test {
     for (const auto& m : messages) EXPECT_EQ(Tallyctl(m).status, 0);
     RunResult r;
     int status = 0;
-    for (int i = 0; i < 6000 && waitpid(pid, &status, WNOHANG) == 0; ++i)
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    if (waitpid(pid, &status, WNOHANG) == 0) {
-      kill(pid, SIGKILL);
-      waitpid(pid, &status, 0);
-    }
+    WaitOrKill(pid, 60, &status);
     r.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
     r.err = platform::ReadFile(err_file).value_or("");
     EXPECT_FALSE(platform::FileExists(socket)) << "the socket is removed at exit";

@@ -112,13 +112,7 @@ TEST_F(HandedSocketTest, ServesTheSocketItIsHandedAndLeavesItsPath) {
       close(lock);
     }
     int status = 0;
-    for (int i = 0; i < 3000 && waitpid(pid, &status, WNOHANG) == 0; ++i)
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    if (waitpid(pid, &status, WNOHANG) == 0) {
-      kill(pid, SIGKILL);
-      waitpid(pid, &status, 0);
-      ADD_FAILURE() << "the service did not end";
-    }
+    if (!WaitOrKill(pid, 30, &status)) ADD_FAILURE() << "the service did not end";
     const std::string err = platform::ReadFile(err_file).value_or("");
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << err;
 
