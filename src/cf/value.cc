@@ -507,6 +507,12 @@ std::span<const std::pair<Value, Value>> Dictionary::entries() const {
 }
 const std::pair<Value, Value>* Dictionary::begin() const { return impl_->entries.begin(); }
 const std::pair<Value, Value>* Dictionary::end() const { return impl_->entries.end(); }
+Dictionary Dictionary::Of(std::initializer_list<std::pair<const char*, Value>> entries) {
+  Dictionary d;
+  for (const auto& [k, v] : entries) d.Set(k, v);
+  return d;
+}
+
 Dictionary Dictionary::OfUnsigned(const NamedUnsigned* pairs, size_t count) {
   Dictionary out;
   if (count == 0) return out;

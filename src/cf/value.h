@@ -16,6 +16,7 @@
 #include <compare>
 #include <cstdint>
 #include <cstring>
+#include <initializer_list>
 #include <iosfwd>
 #include <memory>
 #include <optional>
@@ -298,6 +299,8 @@ class Dictionary {
   Dictionary MutableCopy() const;
   bool SameAs(const Dictionary& o) const { return impl_ == o.impl_; }
 
+  // The pairs, set in order (a later key replaces an earlier one's value).
+  static Dictionary Of(std::initializer_list<std::pair<const char*, Value>> entries);
   // The dictionary Set would leave, called with each pair in order on an
   // empty one: string keys, unsigned 64-bit numbers, a later name replacing
   // the earlier value in its place. Built in passes rather than pair by

@@ -13,9 +13,7 @@
 namespace {
 
 cf::Dictionary D(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
-  cf::Dictionary d;
-  for (const auto& [k, v] : entries) d.Set(k, v);
-  return d;
+  return cf::Dictionary::Of(entries);
 }
 
 class ConfigTest : public ::testing::Test {

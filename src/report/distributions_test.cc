@@ -13,9 +13,7 @@
 namespace {
 
 cf::Dictionary Opts(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
-  cf::Dictionary d;
-  for (const auto& [k, v] : entries) d.Set(k, v);
-  return d;
+  return cf::Dictionary::Of(entries);
 }
 
 cf::Array Bounds(std::initializer_list<cf::Value> bounds) { return cf::Array(std::vector<cf::Value>(bounds)); }

@@ -95,9 +95,7 @@ cf::Dictionary MspFields(uint32_t msp) {
 }
 
 cf::Dictionary Entry(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
-  cf::Dictionary d;
-  for (const auto& [k, v] : entries) d.Set(k, v);
-  return d;
+  return cf::Dictionary::Of(entries);
 }
 
 cf::Dictionary Numbers(std::initializer_list<std::pair<const char*, int64_t>> entries) {

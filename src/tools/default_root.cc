@@ -253,9 +253,7 @@ bool WriteLibraryAndStore(platform::Context& c, const std::string& support_libra
 }
 
 cf::Dictionary Entry(std::initializer_list<std::pair<const char*, cf::Value>> entries) {
-  cf::Dictionary d;
-  for (const auto& [k, v] : entries) d.Set(k, v);
-  return d;
+  return cf::Dictionary::Of(entries);
 }
 
 }  // namespace
