@@ -1,10 +1,14 @@
+#include <cstdio>
 #include <cstdlib>
 #include <string>
 
 #include "driver/driver.h"
+#include "platform/clock.h"
 #include "platform/context.h"
+#include "platform/device_root.h"
 #include "platform/files.h"
 #include "platform/log.h"
+#include "platform/run_record.h"
 #include "platform/service.h"
 #include "platform/store.h"
 #include "platform/upkeep.h"
@@ -12,6 +16,23 @@
 using platform::LogDefault;
 
 namespace {
+
+constexpr const char* kUsage =
+    "usage: tallyrun [-d | -f | -t]\n"
+    "  -d   the gated daily run: yesterday's work, at most once per day (what the daily timer runs)\n"
+    "  -f   yesterday's work now, whatever the gate says (the gate record is left as it is)\n"
+    "  -t   today's work so far\n"
+    "  without an argument: serve the service socket until ten quiet seconds pass\n"
+    "\n"
+    "Environment:\n"
+    "  TALLYRUN_ROOT         the device root (default /var/lib/tallyrun; make one with devsim init DIR)\n"
+    "  TALLYRUN_NOW          run as if at this moment (epoch seconds or ISO-8601)\n"
+    "  TALLYRUN_LOG_STDERR=1 also write the log to standard error\n"
+    "  TALLYRUN_LOG_DEBUG=1  keep debug lines\n"
+    "  TALLYRUN_GROUP        a group that may read what the job writes\n"
+    "\n"
+    "The log goes to syslog under the name tallyrun (journalctl -t tallyrun).\n"
+    "The exit status is always 0; `tallybook status` tells how the last run went.\n";
 
 // How long the service waits for an event before it ends: 10 seconds, or
 // TALLYRUN_SERVICE_IDLE_SECONDS for tests and debugging.
@@ -22,11 +43,71 @@ double IdleSeconds() {
   return !text.empty() && end && *end == '\0' && v > 0 && v <= 3600 ? v : 10.0;
 }
 
+// A problem that stops the run before it starts: to the log, and to a
+// person's terminal once.
+void SayStop(const std::string& message) {
+  platform::LogError("%s", message);
+  if (!platform::LogMirroredToStderr()) std::fprintf(stderr, "tallyrun: %s\n", message.c_str());
+}
+
+// The record's name for a mode, or empty for an argument that runs nothing.
+std::string ModeOf(int argc, char** argv) {
+  if (argc == 1) return "service";
+  if (argc < 2) return "";
+  const std::string arg = argv[1];
+  return arg == "-d" || arg == "-f" || arg == "-t" ? arg : "";
+}
+
+// The line that closes a run: how it went, as the record says.
+void LogRunEnd() {
+  const auto record = platform::EndRun();
+  if (!record) return;
+  std::string line = "run " + record->outcome;
+  if (record->day) line += " for day " + std::to_string(*record->day) + " (" + platform::DayDate(*record->day) + ")";
+  if (!record->log.empty()) line += ": " + record->log;
+  line += "; " + std::to_string(record->error_count) + (record->error_count == 1 ? " error line" : " error lines");
+  if (record->outcome == platform::kOutcomeFailed) platform::LogError("%s", line);
+  else LogDefault("%s", line);
+}
+
 }  // namespace
 
 int TallyrunMain(int argc, char** argv) {
   platform::ApplyPrivateUmask();
   LogDefault("tallyrun started");
+  const std::string mode = ModeOf(argc, argv);
+  if (argc >= 2 && mode.empty()) {
+    const std::string arg = argv[1];
+    LogDefault("Unknown arg: %s", arg);
+    if (arg == "--version") std::fprintf(stderr, "tallyrun %s\n", TALLYRUN_VERSION);
+    else if (arg == "--help" || arg == "-h") std::fputs(kUsage, stderr);
+    else std::fprintf(stderr, "tallyrun: unknown option '%s'; nothing was run (tallyrun --help for the options)\n", arg.c_str());
+    LogDefault("tallyrun ended");
+    return 0;
+  }
+  if (argc < 1) {
+    LogDefault("tallyrun ended");
+    return 0;
+  }
+  // A mistyped root is never made into one, and a directory that is not a
+  // root is never touched.
+  const platform::RootCheck root = platform::CheckDeviceRoot(platform::Context::Current().root());
+  if (!root.ok()) {
+    SayStop(root.message + "; nothing was run");
+    LogDefault("tallyrun ended");
+    return 0;
+  }
+  platform::SetRunMode(mode);
+  // A mistyped moment would put the day's work on the wrong day: nothing
+  // runs, and the record says why.
+  if (const auto clock_error = platform::ClockOverrideError()) {
+    SayStop(*clock_error + "; nothing was run");
+    platform::NoteRunFailure(*clock_error);
+    platform::BeginRun();
+    LogRunEnd();
+    LogDefault("tallyrun ended");
+    return 0;
+  }
   // One instance at a time: a run waits for the one before it (and then
   // finds its gate record); a service that finds another one running leaves
   // that one its socket. A service the service manager started for a
@@ -61,14 +142,20 @@ int TallyrunMain(int argc, char** argv) {
       LogDefault("never received requested AAI, so moving along without it");
       RunDailyTasksIfDayChanged(cf::Value());
     }
-  } else if (argc >= 2) {
+  } else {
     const int32_t today = TBDaysSince1970();
-    const std::string arg = argv[1];
-    if (arg == "-d") RunDailyTasksIfDayChanged(cf::Value());
-    else if (arg == "-f") RunDailyTasks(today - 1, cf::Value());
-    else if (arg == "-t") RunDailyTasks(today, cf::Value());
-    else LogDefault("Unknown arg: %s", arg);
+    platform::BeginRun();
+    if (mode == "-d") {
+      RunDailyTasksIfDayChanged(cf::Value());
+    } else if (mode == "-f") {
+      LogDefault("yesterday's work, forced: day %d (%s)", today - 1, platform::DayDate(today - 1));
+      RunDailyTasks(today - 1, cf::Value());
+    } else {
+      LogDefault("today's work so far: day %d (%s)", today, platform::DayDate(today));
+      RunDailyTasks(today, cf::Value());
+    }
   }
+  LogRunEnd();
   LogDefault("tallyrun ended");
   return 0;
 }

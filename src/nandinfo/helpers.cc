@@ -183,5 +183,6 @@ uint64_t roundSig(uint64_t value, uint64_t digits) {
 void SayNANDInfo(std::string_view line) {
   if (!line.empty() && line.back() == '\n') line.remove_suffix(1);
   platform::LogDefault("%s", std::string(line));
-  std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
+  // Once on a person's terminal: the mirrored log has printed it already.
+  if (!platform::LogMirroredToStderr()) std::fprintf(stderr, "%.*s\n", static_cast<int>(line.size()), line.data());
 }

@@ -44,6 +44,15 @@ void CivilFromDays(int64_t days, int64_t* year, unsigned* month, unsigned* day) 
   *year = static_cast<int64_t>(yoe) + era * 400 + (*month <= 2);
 }
 
+std::string DayDate(int64_t day) {
+  int64_t year = 0;
+  unsigned month = 0, mday = 0;
+  CivilFromDays(day, &year, &month, &mday);
+  char buf[32];
+  std::snprintf(buf, sizeof buf, "%04lld-%02u-%02u", static_cast<long long>(year), month, mday);
+  return buf;
+}
+
 std::optional<double> ParseInstant(std::string_view text) {
   if (text.empty()) return std::nullopt;
   // Epoch seconds, possibly negative or fractional.
@@ -114,15 +123,19 @@ std::optional<double> ParseInstant(std::string_view text) {
   return std::nullopt;
 }
 
+std::optional<std::string> ClockOverrideError() {
+  const char* env = std::getenv("TALLYRUN_NOW");
+  if (!env || !*env || ParseInstant(env)) return std::nullopt;
+  return std::string("TALLYRUN_NOW=\"") + env +
+         "\" is not a moment: give epoch seconds (1795435200) or an ISO-8601 date or date-time "
+         "(2026-11-22, 2026-11-22T10:00:00, 2026-11-22T10:00:00Z, 2026-11-22T10:00:00+02:00), or unset it";
+}
+
+// A TALLYRUN_NOW that does not parse leaves the real clock here; the
+// programs refuse to run on it before they read the clock (ClockOverrideError).
 SystemClock::SystemClock() {
   const char* env = std::getenv("TALLYRUN_NOW");
-  if (env && *env) {
-    fixed_ = ParseInstant(env);
-    // Under the name of the program that reads it: each tool speaks for itself.
-    if (!fixed_)
-      std::fprintf(stderr, "%s: ignoring TALLYRUN_NOW=\"%s\": not epoch seconds or an ISO-8601 date-time\n",
-                   program_invocation_short_name, env);
-  }
+  if (env && *env) fixed_ = ParseInstant(env);
 }
 
 double SystemClock::Now() { return fixed_ ? *fixed_ : static_cast<double>(time(nullptr)); }

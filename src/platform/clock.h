@@ -65,9 +65,18 @@ class FixedClock : public Clock {
 // "2026-11-22"); without a zone the time is local (TZ). Nothing for other text.
 std::optional<double> ParseInstant(std::string_view text);
 
+// Why TALLYRUN_NOW cannot be used (naming the variable and the forms it
+// takes), or nothing when it is unset or valid. A mistyped moment is never
+// replaced by the real clock: every program refuses to run on it.
+std::optional<std::string> ClockOverrideError();
+
 // Civil calendar arithmetic (proleptic Gregorian), days relative to 1970-01-01.
 int64_t DaysFromCivil(int64_t year, unsigned month, unsigned day);
 void CivilFromDays(int64_t days, int64_t* year, unsigned* month, unsigned* day);
+
+// The calendar date (YYYY-MM-DD) of a day number. Day numbers already count
+// local days, so no time zone enters here.
+std::string DayDate(int64_t day);
 
 // The local time of t (epoch seconds) as strftime writes it with format.
 std::string LocalStamp(double t, const char* format);

@@ -6,6 +6,7 @@
 #include "platform/device_model.h"
 #include "platform/log.h"
 #include "platform/prefs.h"
+#include "platform/run_record.h"
 #include "platform/store.h"
 
 namespace platform {
@@ -85,7 +86,10 @@ TallyStore* Context::store(std::string* error) {
   if (!store_ && !store_tried_) {
     store_tried_ = true;
     store_ = TallyStore::Open(Path(kStoreDevicePath), TallyStore::Mode::kCreate, &store_error_);
-    if (!store_) LogError("Tallybook store unavailable: %s", store_error_);
+    if (!store_) {
+      LogError("Tallybook store unavailable: %s", store_error_);
+      NoteRunFailure("the store could not be opened: " + store_error_);
+    }
   }
   if (!store_ && error) *error = store_error_;
   return store_.get();

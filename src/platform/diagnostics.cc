@@ -20,6 +20,7 @@
 #include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
+#include "platform/run_record.h"
 #include "platform/files.h"
 #include "platform/log.h"
 #include "platform/profile.h"
@@ -68,8 +69,11 @@ std::vector<Entry> RegularFiles(const std::string& dir) {
 
 using namespace platform;
 
-bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, const cf::Value& options,
-                              const cf::Value& /*reserved*/, const std::function<void(LogOutput&)>& writer) {
+namespace {
+
+// The submission itself; its file name goes to *submitted.
+bool WriteSubmission(std::string_view type, std::string_view name, const cf::Value& options,
+                     const std::function<void(LogOutput&)>& writer, std::string* submitted) {
   const std::string dir = Context::Current().Path(kSubmissionsDir);
   if (type.empty() || name.empty() || type.find('/') != std::string_view::npos ||
       name.find('/') != std::string_view::npos) {
@@ -132,6 +136,20 @@ bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, cons
     return false;
   }
   if (!d->Sync()) LogError("Cannot sync %s: %s", dir, std::strerror(errno));
+  *submitted = final_name;
+  return true;
+}
+
+}  // namespace
+
+bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, const cf::Value& options,
+                              const cf::Value& /*reserved*/, const std::function<void(LogOutput&)>& writer) {
+  std::string submitted;
+  if (!WriteSubmission(type, name, options, writer, &submitted)) {
+    NoteRunFailure("the " + std::string(name) + " log could not be submitted");
+    return false;
+  }
+  if (name == "log-aggregated") NoteSubmittedLog(submitted);
   return true;
 }
 

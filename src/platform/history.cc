@@ -6,6 +6,7 @@
 #include "platform/files.h"
 #include "platform/log.h"
 #include "platform/prefs.h"
+#include "platform/run_record.h"
 #include "platform/store.h"
 
 namespace platform {
@@ -40,6 +41,7 @@ using StatementPtr = std::unique_ptr<sqlite3_stmt, Finalizer>;
 // for the next report, written at once since this process may not get far.
 bool ReadFailed(sqlite3* db, int rc) {
   LogError("Tallybook history read failed: %s", sqlite3_errmsg(db));
+  NoteRunFailure(std::string("the store could not be read: ") + sqlite3_errmsg(db));
   const int primary = rc & 0xff;
   if (primary == SQLITE_CORRUPT || primary == SQLITE_NOTADB) {
     const int64_t count = DGVPreferencesGetIntegerValue(kStoreCorruptionKey, kStoreCorruptionDomain);
@@ -81,7 +83,11 @@ bool TBHistoryDistributionEnumerator::getNextValue(double* value, int32_t* secon
 }
 
 std::unique_ptr<TBHistory> TBHistory::initWithDefaultPath(std::string* error) {
-  return initWithPath(Context::Current().Path(kStoreDevicePath), error);
+  std::string why;
+  auto history = initWithPath(Context::Current().Path(kStoreDevicePath), &why);
+  if (!history) NoteRunFailure("the store could not be opened: " + why);
+  if (error) *error = why;
+  return history;
 }
 
 std::unique_ptr<TBHistory> TBHistory::initWithPath(const std::string& path, std::string* error) {

@@ -9,6 +9,7 @@
 #include <string>
 
 #include "platform/context.h"
+#include "platform/run_record.h"
 
 namespace platform {
 
@@ -23,8 +24,10 @@ const char* LogLevelName(LogLevel level) {
   return "?";
 }
 
+bool LogMirroredToStderr() { return EnvOr("TALLYRUN_LOG_STDERR", "0") == "1"; }
+
 SyslogSink::SyslogSink()
-    : mirror_(EnvOr("TALLYRUN_LOG_STDERR", "0") == "1"), debug_(EnvOr("TALLYRUN_LOG_DEBUG", "0") == "1") {
+    : mirror_(LogMirroredToStderr()), debug_(EnvOr("TALLYRUN_LOG_DEBUG", "0") == "1") {
   openlog(program_invocation_short_name, LOG_PID, LOG_USER);
 }
 
@@ -74,6 +77,9 @@ void CaptureLog::Clear() {
   lines_.clear();
 }
 
-void Log(LogLevel level, std::string_view text) { Context::Current().log().Write(level, text); }
+void Log(LogLevel level, std::string_view text) {
+  if (level == LogLevel::kError || level == LogLevel::kFault) CountErrorLine(text);
+  Context::Current().log().Write(level, text);
+}
 
 }  // namespace platform

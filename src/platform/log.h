@@ -55,6 +55,10 @@ class CaptureLog : public LogSink {
 
 void Log(LogLevel level, std::string_view text);
 
+// True when TALLYRUN_LOG_STDERR=1 mirrors the system log to standard error,
+// so that what must reach a person's terminal is printed there once.
+bool LogMirroredToStderr();
+
 template <typename... A>
 void LogDefault(std::string_view fmt, const A&... a) { Log(LogLevel::kDefault, cf::Format(fmt, a...)); }
 template <typename... A>

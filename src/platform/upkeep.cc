@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/context.h"
+#include "platform/device_root.h"
 #include "platform/diagnostics.h"
 #include "platform/files.h"
 #include "platform/log.h"
@@ -109,6 +110,9 @@ class Tidier {
 
 void TidyRoot() {
   const std::string& root = Context::Current().root();
+  // Never in a directory that is not a root: a mistaken TALLYRUN_ROOT must
+  // not cost some other directory its modes or its temporary files.
+  if (!CheckDeviceRoot(root).ok()) return;
   const int root_fd = open(root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   if (root_fd < 0) return;
   Tidier tidier(root);

@@ -15,6 +15,7 @@
 
 #include "platform/clock.h"
 #include "platform/context.h"
+#include "platform/device_root.h"
 #include "platform/files.h"
 
 // Nothing when the program should go on; otherwise its exit status (0 after
@@ -46,36 +47,24 @@ inline std::optional<int> ParseCommandLine(CLI::App& app, int argc, char** argv)
     app.exit(e);
     return 2;
   }
+  // A mistyped moment would put what the tool reads or writes on the wrong day.
+  if (const auto clock_error = platform::ClockOverrideError()) {
+    const char* slash = std::strrchr(argv[0], '/');
+    std::fprintf(stderr, "%s: %s\n", slash ? slash + 1 : argv[0], clock_error->c_str());
+    return 2;
+  }
   return std::nullopt;
 }
 
-// The device root (TALLYRUN_ROOT) must be a directory this user can read: a
-// mistyped root is an error, never a reason to make a new one, and a root we
-// cannot read is not one to write into. Nothing when it is fine; otherwise
-// the exit status, after a message.
+// The device root (TALLYRUN_ROOT) must be a root `devsim init` made, that
+// this user can read: a mistyped root is an error, never a reason to make a
+// new one or to write into some other directory. Nothing when it is fine;
+// otherwise the exit status, after a message.
 inline std::optional<int> CheckDeviceRoot(const char* tool) {
-  const std::string& root = platform::Context::Current().root();
-  auto fail = [&](const std::string& message) {
-    std::fprintf(stderr, "%s: %s\n", tool, message.c_str());
-    return std::optional<int>(1);
-  };
-  struct stat st;
-  if (stat(root.c_str(), &st) != 0) {
-    const int cause = errno;
-    if (cause == ENOENT)
-      return fail("no device root at " + root + " (TALLYRUN_ROOT); make one with: devsim init " + root);
-    return fail("cannot use the device root " + root + ": " + std::strerror(cause));
-  }
-  if (!S_ISDIR(st.st_mode)) return fail("the device root " + root + " is not a directory");
-  // A root that grants no one reading is locked on purpose, even against
-  // the superuser, who would otherwise fill it with files of its own.
-  if ((st.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0)
-    return fail("cannot read the device root " + root + ": " + std::strerror(EACCES));
-  if (access(root.c_str(), R_OK | X_OK) != 0) {
-    const int cause = errno;
-    return fail("cannot read the device root " + root + ": " + std::strerror(cause));
-  }
-  return std::nullopt;
+  const platform::RootCheck check = platform::CheckDeviceRoot(platform::Context::Current().root());
+  if (check.ok()) return std::nullopt;
+  std::fprintf(stderr, "%s: %s\n", tool, check.message.c_str());
+  return 1;
 }
 
 // A day as the tools take it: a day number (whole local days since

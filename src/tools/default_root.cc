@@ -10,6 +10,7 @@
 #include "nandinfo/view_tables.h"
 #include "platform/clock.h"
 #include "platform/context.h"
+#include "platform/device_root.h"
 #include "platform/faultkeep.h"
 #include "platform/files.h"
 #include "platform/host_disk.h"
@@ -262,7 +263,7 @@ bool WriteHostRoot(const std::string& root, const std::string& support_library, 
                    std::string* error) {
   platform::ContextScope scope(root);
   platform::Context& c = scope.context();
-  if (!WriteCommonFiles(c, true, error)) return false;
+  if (!platform::WriteRootMarker(root, error) || !WriteCommonFiles(c, true, error)) return false;
   // Any files of an earlier default root there would put simulated parts
   // back beside the disks.
   for (const char* name : {"controller.plist", "stackshot.plist", "purgeable.plist", "ecc-events.plist",
@@ -288,7 +289,7 @@ bool WriteHostRoot(const std::string& root, const std::string& support_library, 
 bool WriteDefaultRoot(const std::string& root, const std::string& support_library, std::string* error) {
   platform::ContextScope scope(root);
   platform::Context& c = scope.context();
-  if (!WriteCommonFiles(c, false, error)) return false;
+  if (!platform::WriteRootMarker(root, error) || !WriteCommonFiles(c, false, error)) return false;
   cf::Dictionary version;
   version.Set("ProductName", "boxOS");
   version.Set("ProductVersion", "4.2");

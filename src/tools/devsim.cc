@@ -20,6 +20,7 @@
 #include "nandinfo/views.h"
 #include "parsers/parsers.h"
 #include "platform/context.h"
+#include "platform/device_root.h"
 #include "platform/files.h"
 #include "tools/cli.h"
 #include "tools/default_root.h"
@@ -116,20 +117,31 @@ int Snapshot(const std::string& file, const std::string& header_file) {
 
 // --force: a root made again keeps nothing of the old one (not its store,
 // gate record, submissions or logs), so it is the root a fresh init gives.
-// Only a directory that holds a device root is emptied; each entry removed
-// is named. False, after a message, when DIR is something else.
+// Only a root devsim made (it carries the marker) is emptied, never "/" or
+// the home directory; each entry removed is named. False, after a message
+// and with nothing removed, for anything else.
 bool ClearOldRoot(const std::string& dir) {
   namespace fs = std::filesystem;
   std::error_code ec;
+  if (platform::IsProtectedDirectory(dir)) {
+    std::fprintf(stderr, "devsim: %s is never a device root; not removing anything\n", dir.c_str());
+    return false;
+  }
   if (!fs::exists(dir, ec) || fs::is_empty(dir, ec)) return true;
-  if (!fs::is_directory(fs::path(dir) / "device", ec) && !fs::is_directory(fs::path(dir) / "var", ec)) {
-    std::fprintf(stderr, "devsim: %s is not empty and holds no device root (no device/ or var/); not removing anything\n",
-                 dir.c_str());
+  if (!platform::HasRootMarker(dir)) {
+    std::fprintf(stderr,
+                 "devsim: %s is not empty and is not a device root made by devsim init (no %s); not removing "
+                 "anything\n",
+                 dir.c_str(), platform::kRootMarkerName);
     return false;
   }
   std::vector<fs::path> entries;
   for (const auto& e : fs::directory_iterator(dir, ec)) entries.push_back(e.path());
   std::sort(entries.begin(), entries.end());
+  // The marker goes last, so a removal that stops half way leaves a root
+  // that --force may still empty.
+  std::stable_partition(entries.begin(), entries.end(),
+                        [](const fs::path& p) { return p.filename() != platform::kRootMarkerName; });
   for (const fs::path& entry : entries) {
     // remove_all does not follow links: a link's target stays untouched.
     fs::remove_all(entry, ec);
@@ -345,6 +357,10 @@ int main(int argc, char** argv) {
   if (reporting->parsed()) return Reporting(reporting_root, categories, reporting_json, interval);
   if (init->parsed()) {
     std::error_code ec;
+    if (platform::IsProtectedDirectory(dir)) {
+      std::fprintf(stderr, "devsim: %s is never a device root; make one in a directory of its own\n", dir.c_str());
+      return 2;
+    }
     if (std::filesystem::exists(dir, ec) && !std::filesystem::is_directory(dir, ec)) {
       std::fprintf(stderr, "devsim: %s exists and is not a directory\n", dir.c_str());
       return 2;

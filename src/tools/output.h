@@ -15,16 +15,7 @@
 
 namespace tools {
 
-// The calendar date (YYYY-MM-DD) of a day number. Day numbers already count
-// local days, so no time zone enters here.
-inline std::string IsoDate(int64_t day) {
-  int64_t year = 0;
-  unsigned month = 0, mday = 0;
-  platform::CivilFromDays(day, &year, &month, &mday);
-  char buf[32];
-  std::snprintf(buf, sizeof buf, "%04lld-%02u-%02u", static_cast<long long>(year), month, mday);
-  return buf;
-}
+inline std::string IsoDate(int64_t day) { return platform::DayDate(day); }
 
 // The shortest text that reads back as the same double.
 inline std::string RealText(double d) {

@@ -15,6 +15,7 @@
 #include "tools/cli.h"
 #include "tools/line_chart.h"
 #include "tools/output.h"
+#include "tools/status.h"
 #include "cf/plist.h"
 #include "platform/clock.h"
 #include "platform/context.h"
@@ -179,19 +180,21 @@ int main(int argc, char** argv) {
   std::string key, value_text, prefix;
   int64_t offset = 0, day = 0;
 
-  auto* set = app.add_subcommand("set", "Set today's value of a scalar key");
+  std::string day_text, write_day_text;
+  auto* set = app.add_subcommand("set", "Set a day's value of a scalar key (today unless --day)");
   set->add_option("KEY", key)->required();
   set->add_option("VALUE", value_text, "signed 64-bit integer")->required();
-  auto* add = app.add_subcommand("add", "Add to today's value of a scalar key");
+  auto* add = app.add_subcommand("add", "Add to a day's value of a scalar key (today unless --day)");
   add->add_option("KEY", key)->required();
   add->add_option("VALUE", value_text, "signed 64-bit integer")->required();
-  auto* push = app.add_subcommand("push", "Push a sample of a distribution key for today");
+  auto* push = app.add_subcommand("push", "Push a sample of a distribution key into a day (today unless --day)");
   push->add_option("KEY", key)->required();
   push->add_option("VALUE", value_text, "real number")->required();
-  auto* offset_opt = push->add_option("--offset", offset, "seconds within the day (default: now)");
+  auto* offset_opt = push->add_option("--offset", offset, "seconds within the day (default: the time of day now)");
+  for (CLI::App* writer : {set, add, push})
+    writer->add_option("--day", write_day_text, "the day to record into: a day number or an ISO date (YYYY-MM-DD)");
   auto* dump = app.add_subcommand("dump", "Print scalars as 'day key value', distributions as "
                                           "'day key count min max mean'");
-  std::string day_text;
   auto* day_opt = dump->add_option("--day", day_text, "only this day: a day number or an ISO date (YYYY-MM-DD)");
   dump->add_option("--prefix", prefix, "only keys starting with this");
   bool json = false;
@@ -207,6 +210,13 @@ int main(int argc, char** argv) {
   plot->add_option("--days", days, "how many days up to today (default 30)");
   plot->add_option("--out", out, "the SVG file to write")->required();
   auto* today = app.add_subcommand("today", "Print today's day number");
+  double max_age_hours = 26;
+  auto* status_cmd = app.add_subcommand(
+      "status", "Say how the last run of tallyrun went; exit 0 (fine and recent), 1 (failed) or 3 (none, too old, "
+                "or held back by the gate)");
+  status_cmd->add_flag("--json", json, "as one JSON object");
+  status_cmd->add_option("--max-age", max_age_hours, "hours a run stays recent (default 26)")
+      ->check(CLI::Range(0.0, 24.0 * 366));
 
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
 
@@ -214,7 +224,8 @@ int main(int argc, char** argv) {
     std::printf("%d\n", TBDaysSince1970());
     return 0;
   }
-  if (const auto status = CheckDeviceRoot("tallybook")) return *status;
+  if (const auto bad_root = CheckDeviceRoot("tallybook")) return *bad_root;
+  if (status_cmd->parsed()) return tools::PrintRunStatus(json, max_age_hours * 3600);
   if (dump->parsed()) {
     if (day_opt->count()) {
       std::string error;
@@ -244,6 +255,15 @@ int main(int argc, char** argv) {
   if (std::string why; !cf::IsPropertyListString(key, &why))
     return BadInput("key cannot be stored, a property list cannot carry it: " + why);
   const int32_t today_number = TBDaysSince1970();
+  int32_t write_day = today_number;
+  if (!write_day_text.empty()) {
+    std::string error;
+    const auto parsed = ParseDay(write_day_text, &error);
+    if (!parsed) return BadInput(error);
+    if (*parsed < 0 || *parsed > std::numeric_limits<int32_t>::max())
+      return BadInput("day number out of range: " + write_day_text);
+    write_day = static_cast<int32_t>(*parsed);
+  }
   if (push->parsed()) {
     double value = 0;
     if (!ParseReal(value_text, &value)) return BadInput("value is not a finite real number: \"" + value_text + "\"");
@@ -253,7 +273,7 @@ int main(int argc, char** argv) {
       return BadInput("offset must be seconds within the day (0 to 90000): " + std::to_string(offset));
     platform::TallyStore* store = OpenStore();
     if (!store) return kStoreError;
-    if (!store->PushSample(today_number, key, value, static_cast<int32_t>(offset))) {
+    if (!store->PushSample(write_day, key, value, static_cast<int32_t>(offset))) {
       std::fprintf(stderr, "tallybook: %s\n", store->last_error().c_str());
       return kStoreError;
     }
@@ -264,7 +284,7 @@ int main(int argc, char** argv) {
     return BadInput("value is not a signed 64-bit integer: \"" + value_text + "\"");
   platform::TallyStore* store = OpenStore();
   if (!store) return kStoreError;
-  const bool ok = set->parsed() ? store->SetScalar(today_number, key, value) : store->AddScalar(today_number, key, value);
+  const bool ok = set->parsed() ? store->SetScalar(write_day, key, value) : store->AddScalar(write_day, key, value);
   if (!ok) {
     std::fprintf(stderr, "tallybook: %s\n", store->last_error().c_str());
     return store->last_error_is_bad_input() ? kBadInput : kStoreError;

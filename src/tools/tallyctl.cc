@@ -7,6 +7,7 @@
 #include <string>
 
 #include "cf/plist.h"
+#include "platform/store.h"
 #include "tools/cli.h"
 #include "platform/files.h"
 #include "platform/service.h"
@@ -115,6 +116,11 @@ int main(int argc, char** argv) {
     const auto parsed = ParseDay(day_text, &error);
     if (!parsed) return Fail(2, error);
     if (*parsed < 0) return Fail(2, "a day before 1970-01-01 cannot be run: " + day_text);
+    // The service would truncate a larger number to 32 bits and run some
+    // other day; a day after today has nothing to run yet.
+    if (*parsed > TBDaysSince1970())
+      return Fail(2, "day " + day_text + " is after today (day " + std::to_string(TBDaysSince1970()) +
+                         "); nothing was sent");
     day = *parsed;
   }
   if (const auto status = CheckDeviceRoot("tallyctl")) return *status;

@@ -23,13 +23,27 @@ TEST_F(NewcomerTest, MistakesGetMessagesThatHelp) {
   ASSERT_TRUE(platform::WriteFileAtomically(empty_header, ""));
   ASSERT_TRUE(platform::WriteFileAtomically(snapshot, std::string(252, '\1')));
   const std::string day_help = "; `tallybook today` prints today's day number\n";
+  const std::string clock_forms =
+      "\" is not a moment: give epoch seconds (1795435200) or an ISO-8601 date or date-time (2026-11-22, "
+      "2026-11-22T10:00:00, 2026-11-22T10:00:00Z, 2026-11-22T10:00:00+02:00), or unset it\n";
   struct Case {
     const char* program;
     std::vector<std::string> args;
     std::string message;  // the whole of standard error
+    const char* now = "2026-11-22T15:00:00Z";  // TALLYRUN_NOW
   } cases[] = {
+      // A mistyped moment is never replaced by the real clock.
+      {TALLYBOOK_BIN, {"set", "k", "1"}, "tallybook: TALLYRUN_NOW=\"2026-11-2" + clock_forms, "2026-11-2"},
+      {TALLYBOOK_BIN, {"today"}, "tallybook: TALLYRUN_NOW=\"yesterday" + clock_forms, "yesterday"},
+      {TALLYCTL_BIN, {"run-day", "1"}, "tallyctl: TALLYRUN_NOW=\"noon" + clock_forms, "noon"},
+      {DEVSIM_BIN, {"init", root / "other"}, "devsim: TALLYRUN_NOW=\"2026-13-01" + clock_forms, "2026-13-01"},
+      {TALLYBOOK_BIN, {"set", "k", "1", "--day", "2026-11-31"},
+       "tallybook: expected a day number or an ISO date (YYYY-MM-DD), not '2026-11-31'" + day_help},
+      // Nothing to run yet, or a day the service would truncate to another.
+      {TALLYCTL_BIN, {"run-day", "2026-11-23"}, "tallyctl: day 2026-11-23 is after today (day 20779); nothing was sent\n"},
+      {TALLYCTL_BIN, {"run-day", "4294987073"}, "tallyctl: day 4294987073 is after today (day 20779); nothing was sent\n"},
       {TALLYBOOK_BIN, {"frob"},
-       "tallybook: unknown subcommand 'frob'; the subcommands are: set, add, push, dump, history, plot, today "
+       "tallybook: unknown subcommand 'frob'; the subcommands are: set, add, push, dump, history, plot, today, status "
        "(--help for more)\n"},
       {TALLYCTL_BIN, {"frob", "1"},
        "tallyctl: unknown subcommand 'frob'; the subcommands are: logging-status, run-day, app-data, send, show "
@@ -49,7 +63,9 @@ TEST_F(NewcomerTest, MistakesGetMessagesThatHelp) {
        "devsim: the snapshot header " + empty_header + " (0 bytes) describes no records; nothing to print\n"},
   };
   for (const Case& c : cases) {
-    const RunResult r = RunProgram(c.program, c.args, env);
+    auto case_env = env;
+    case_env["TALLYRUN_NOW"] = c.now;
+    const RunResult r = RunProgram(c.program, c.args, case_env);
     EXPECT_EQ(r.status, 2) << c.args[0];
     EXPECT_EQ(r.err, c.message);
     EXPECT_EQ(r.out, "") << c.args[0];
@@ -61,10 +77,7 @@ TEST_F(NewcomerTest, MistakesGetMessagesThatHelp) {
   EXPECT_EQ(by_date.status, 0);
   EXPECT_FALSE(by_date.out.empty());
   EXPECT_EQ(by_date.out, by_number.out);
-  auto bad_clock = env;
-  bad_clock["TALLYRUN_NOW"] = "noon";
-  EXPECT_EQ(RunProgram(TALLYBOOK_BIN, {"today"}, bad_clock).err,
-            "tallybook: ignoring TALLYRUN_NOW=\"noon\": not epoch seconds or an ISO-8601 date-time\n");
+  EXPECT_FALSE(platform::FileExists(root / "other"));
 
   // Means print as the shortest text that reads back.
   ASSERT_EQ(RunProgram(TALLYBOOK_BIN, {"push", "newcomer.ratio", "0.58"}, env).status, 0);
@@ -90,14 +103,26 @@ TEST_F(NewcomerTest, ForceGivesTheRootAFreshInitGives) {
   EXPECT_EQ(Count(r.err, "Day unchanged since last run"), 0u) << r.err;
   EXPECT_EQ(Logs().size(), 1u);
 
-  // A directory that holds no root is never emptied.
+  // Only a root devsim made is ever emptied: not a directory that merely
+  // holds a var/ and a device/, not the home directory, never "/".
   TempDir home;
-  ASSERT_TRUE(platform::WriteFileAtomically(home / "notes.txt", "mine"));
-  const RunResult refused = RunProgram(DEVSIM_BIN, {"init", home.path(), "--force"}, env);
-  EXPECT_EQ(refused.status, 2);
-  EXPECT_EQ(refused.err,
-            "devsim: " + home.path() + " is not empty and holds no device root (no device/ or var/); not removing anything\n");
-  EXPECT_EQ(platform::ReadFile(home / "notes.txt").value_or(""), "mine");
+  ASSERT_TRUE(platform::WriteFileAtomically(home / "var/notes.txt", "mine"));
+  ASSERT_TRUE(platform::WriteFileAtomically(home / "device/notes.txt", "mine"));
+  auto home_env = env;
+  home_env["HOME"] = home.path();
+  const TempDir other;
+  ASSERT_TRUE(fs::create_directory(other / "var"));
+  for (const auto& [dir, message] : std::vector<std::pair<std::string, std::string>>{
+           {other.path(), other.path() + " is not empty and is not a device root made by devsim init (no "
+                                         ".tallyrun-root); not removing anything"},
+           {home.path(), home.path() + " is never a device root; make one in a directory of its own"},
+           {"/", "/ is never a device root; make one in a directory of its own"}}) {
+    const RunResult refused = RunProgram(DEVSIM_BIN, {"init", dir, "--force"}, home_env);
+    EXPECT_EQ(refused.status, 2) << dir;
+    EXPECT_EQ(refused.err, "devsim: " + message + "\n");
+  }
+  EXPECT_EQ(platform::ReadFile(home / "var/notes.txt").value_or(""), "mine");
+  EXPECT_TRUE(fs::is_directory(other / "var"));
 }
 
 }  // namespace

@@ -14,6 +14,7 @@
 
 #include "../temp_dir.h"
 #include "cf/plist.h"
+#include "platform/device_root.h"
 #include "platform/files.h"
 #include "run.h"
 

@@ -5,6 +5,7 @@
 #include <filesystem>
 
 #include "../temp_dir.h"
+#include "platform/device_root.h"
 #include "platform/files.h"
 #include "platform/store.h"
 #include "run.h"
@@ -15,6 +16,8 @@ const std::string kStore = "var/mobile/Library/Tallybook/TBDataStore.sqlitedb";
 
 class TallybookTest : public ::testing::Test {
  protected:
+  // A bare root: the marker alone, the store made by the first write.
+  void SetUp() override { ASSERT_TRUE(platform::WriteRootMarker(root.path(), nullptr)); }
   TempDir root;
   // 2026-11-22 10:00 UTC is day 20779.
   std::map<std::string, std::string> env{
@@ -118,27 +121,42 @@ TEST_F(TallybookTest, ValuesAtTheEdgesOfTheRange) {
 
 TEST_F(TallybookTest, AMissingOrUnreadableRootIsAnError) {
   const std::string typo = root / "no/such/root";
+  const std::string how = "; make one with: devsim init " + typo + " (and set TALLYRUN_ROOT=" + typo + ")\n";
   env["TALLYRUN_ROOT"] = typo;
   for (const auto& args : std::vector<std::vector<std::string>>{{"set", "k", "1"}, {"push", "k", "1"}, {"dump"}}) {
     const RunResult r = Tallybook(args);
     EXPECT_EQ(r.status, 1) << args[0];
-    EXPECT_EQ(r.err, "tallybook: no device root at " + typo + " (TALLYRUN_ROOT); make one with: devsim init " + typo +
-                         "\n");
+    EXPECT_EQ(r.err, "tallybook: no device root at " + typo + how);
   }
   EXPECT_FALSE(platform::FileExists(root / "no"));
   const RunResult ctl = RunProgram(TALLYCTL_BIN, {"logging-status"}, env);
   EXPECT_EQ(ctl.status, 1);
-  EXPECT_EQ(ctl.err, "tallyctl: no device root at " + typo + " (TALLYRUN_ROOT); make one with: devsim init " + typo + "\n");
+  EXPECT_EQ(ctl.err, "tallyctl: no device root at " + typo + how);
   ASSERT_TRUE(platform::WriteFileAtomically(root / "file", "x"));
   env["TALLYRUN_ROOT"] = root / "file";
   EXPECT_EQ(Tallybook({"set", "k", "1"}).err, "tallybook: the device root " + (root / "file") + " is not a directory\n");
   EXPECT_EQ(Tallybook({"today"}).status, 0);  // needs no root
 
+  // A directory that devsim did not make, and "/", are never roots: nothing
+  // is written into them.
+  const std::string plain = root / "plain";
+  ASSERT_TRUE(platform::WriteFileAtomically(plain + "/notes.txt", "mine"));
+  env["TALLYRUN_ROOT"] = plain;
+  RunResult r = Tallybook({"set", "k", "1"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: " + plain + " is not a device root (it has no .tallyrun-root and no store); make one "
+                   "with: devsim init " + plain + " (and set TALLYRUN_ROOT=" + plain + ")\n");
+  EXPECT_FALSE(platform::FileExists(plain + "/var"));
+  env["TALLYRUN_ROOT"] = "/";
+  r = Tallybook({"dump"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "tallybook: / is never a device root; make one with: devsim init DIR (and set TALLYRUN_ROOT=DIR)\n");
+
   // A root locked against everyone, the superuser included.
   namespace fs = std::filesystem;
   env["TALLYRUN_ROOT"] = root.path();
   fs::permissions(root.path(), fs::perms::none);
-  RunResult r = Tallybook({"set", "k", "3"});
+  r = Tallybook({"set", "k", "3"});
   EXPECT_EQ(r.status, 1);
   EXPECT_EQ(r.err, "tallybook: cannot read the device root " + root.path() + ": Permission denied\n");
   r = RunProgram(TALLYCTL_BIN, {"logging-status"}, env);

@@ -23,6 +23,7 @@ std::vector<std::string> Fields(const std::string& line) { return Lines(line, tr
 
 class ToolOutputTest : public ::testing::Test {
  protected:
+  void SetUp() override { ASSERT_TRUE(platform::WriteRootMarker(root.path(), nullptr)); }
   TempDir root;
   // 2026-11-22 is day 20779.
   std::map<std::string, std::string> env{

@@ -1,0 +1,186 @@
+#include "platform/run_record.h"
+
+#include <unistd.h>
+
+#include <climits>
+#include <mutex>
+
+#include "cf/plist.h"
+#include "platform/clock.h"
+#include "platform/context.h"
+#include "platform/files.h"
+#include "platform/log.h"
+
+namespace platform {
+
+namespace {
+
+struct RunState {
+  std::mutex mu;
+  bool begun = false;
+  bool unchanged = false;
+  bool submission_off = false;
+  RunRecord record;
+  uint64_t error_count = 0;
+  std::vector<std::string> errors;
+  std::vector<std::string> failures;
+};
+
+RunState& State() {
+  static auto* const state = new RunState;  // never destroyed: late log lines still count
+  return *state;
+}
+
+// Written through the file layer, so privately, atomically and never
+// through a link. A record that cannot be written is one more error line:
+// it cannot fail the run it describes.
+void Write(const RunRecord& record) {
+  std::string bytes, error;
+  if (!cf::WriteXMLPropertyList(record.ToValue(), bytes, &error) ||
+      !WriteFileAtomically(Context::Current().Path(kRunRecordPath), bytes, &error))
+    LogError("Could not record how the run went: %s", error);
+}
+
+}  // namespace
+
+cf::Value RunRecord::ToValue() const {
+  cf::Dictionary d;
+  d.Set("mode", mode);
+  if (day) d.Set("day", cf::Value::SInt32(*day));
+  d.Set("started", cf::Date{started});
+  if (ended) d.Set("ended", cf::Date{*ended});
+  d.Set("outcome", outcome);
+  d.Set("pid", cf::Value::SInt64(pid));
+  if (!log.empty()) d.Set("log", log);
+  d.Set("errorCount", cf::Value::UInt64(error_count));
+  cf::Array quoted, why;
+  for (const std::string& e : errors) quoted.Append(e);
+  for (const std::string& f : failures) why.Append(f);
+  d.Set("errors", quoted);
+  d.Set("failures", why);
+  return d;
+}
+
+std::optional<RunRecord> RunRecord::FromValue(const cf::Value& value) {
+  const cf::Dictionary* d = value.AsDictionary();
+  if (!d) return std::nullopt;
+  auto text = [&](const char* key) -> const cf::String* { return d->Get(key).AsString(); };
+  const cf::Value& started = d->Get("started");
+  if (!text("mode") || !text("outcome") || !started.AsDate()) return std::nullopt;
+  RunRecord r;
+  r.mode = text("mode")->str();
+  r.outcome = text("outcome")->str();
+  r.started = started.AsDate()->seconds;
+  if (const cf::Date* ended = d->Get("ended").AsDate()) r.ended = ended->seconds;
+  if (const cf::Number* day = d->Get("day").AsNumber()) {
+    const int64_t v = day->AsSInt64();
+    if (v < INT32_MIN || v > INT32_MAX) return std::nullopt;
+    r.day = static_cast<int32_t>(v);
+  }
+  if (const cf::Number* pid = d->Get("pid").AsNumber()) r.pid = pid->AsSInt64();
+  if (const cf::String* log = text("log")) r.log = log->str();
+  if (const cf::Number* count = d->Get("errorCount").AsNumber()) r.error_count = count->AsUInt64();
+  for (const auto& [key, list] : {std::pair{"errors", &r.errors}, std::pair{"failures", &r.failures}})
+    if (const cf::Array* a = d->Get(key).AsArray())
+      for (const cf::Value& v : *a)
+        if (const cf::String* s = v.AsString()) list->push_back(s->str());
+  return r;
+}
+
+void SetRunMode(const std::string& mode) {
+  std::lock_guard<std::mutex> lock(State().mu);
+  State().record.mode = mode;
+}
+
+void BeginRun() {
+  RunRecord snapshot;
+  {
+    RunState& s = State();
+    std::lock_guard<std::mutex> lock(s.mu);
+    if (s.begun) return;
+    s.begun = true;
+    s.record.started = Now();
+    s.record.pid = getpid();
+    s.record.outcome = kOutcomeRunning;
+    snapshot = s.record;
+    snapshot.error_count = s.error_count;
+    snapshot.errors = s.errors;
+    snapshot.failures = s.failures;
+  }
+  Write(snapshot);
+}
+
+void NoteRunDay(int32_t day) {
+  std::lock_guard<std::mutex> lock(State().mu);
+  State().record.day = day;
+}
+
+void NoteRunFailure(const std::string& why) {
+  std::lock_guard<std::mutex> lock(State().mu);
+  if (State().failures.size() < kRunRecordQuotedErrors) State().failures.push_back(why);
+}
+
+void NoteSubmittedLog(const std::string& file) {
+  std::lock_guard<std::mutex> lock(State().mu);
+  State().record.log = file;
+}
+
+void NoteDayUnchanged() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  State().unchanged = true;
+}
+
+void NoteSubmissionOff() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  State().submission_off = true;
+}
+
+bool RunSubmittedLog() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  return !State().record.log.empty();
+}
+
+bool RunHasFailed() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  return !State().failures.empty();
+}
+
+std::optional<RunRecord> EndRun() {
+  RunRecord r;
+  {
+    RunState& s = State();
+    std::lock_guard<std::mutex> lock(s.mu);
+    if (!s.begun) return std::nullopt;
+    r = s.record;
+    r.error_count = s.error_count;
+    r.errors = s.errors;
+    r.failures = s.failures;
+  }
+  r.ended = Now();
+  const RunState& s = State();
+  r.outcome = !r.failures.empty()  ? kOutcomeFailed
+              : s.unchanged        ? kOutcomeUnchanged
+              : !r.log.empty()     ? kOutcomeSubmitted
+              : s.submission_off   ? kOutcomeSubmissionOff
+                                   : kOutcomeNothingWhitelisted;
+  Write(r);
+  return r;
+}
+
+std::optional<RunRecord> ReadRunRecord(std::string* error) {
+  const std::string path = Context::Current().Path(kRunRecordPath);
+  if (!FileExists(path)) return std::nullopt;
+  const auto bytes = ReadFile(path, error);
+  if (!bytes) return std::nullopt;
+  auto record = RunRecord::FromValue(cf::ParsePropertyList(*bytes).value);
+  if (!record && error) *error = path + " is not a run record";
+  return record;
+}
+
+void CountErrorLine(std::string_view text) {
+  std::lock_guard<std::mutex> lock(State().mu);
+  ++State().error_count;
+  if (State().errors.size() < kRunRecordQuotedErrors) State().errors.emplace_back(text);
+}
+
+}  // namespace platform
