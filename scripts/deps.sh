@@ -3,7 +3,7 @@
 set -euo pipefail
 packages=(cmake ninja-build g++ clang libclang-rt-14-dev pkg-config sqlite3 libsqlite3-dev libplist-dev libplist-utils
   nlohmann-json3-dev libssl-dev libcli11-dev libgtest-dev libgmock-dev libbenchmark-dev
-  libxml2-dev libnvme-dev libsystemd-dev)
+  libxml2-dev libnvme-dev libsystemd-dev faketime)
 missing=()
 for p in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
