@@ -142,7 +142,7 @@ bool RunSubmittedLog() {
 
 bool RunHasFailed() {
   std::lock_guard<std::mutex> lock(State().mu);
-  return !State().failures.empty();
+  return !State().failures.empty() || State().error_count > 0;
 }
 
 std::optional<RunRecord> EndRun() {
@@ -155,14 +155,15 @@ std::optional<RunRecord> EndRun() {
     r.error_count = s.error_count;
     r.errors = s.errors;
     r.failures = s.failures;
+    // An error line is a step that went wrong; what a machine merely lacks
+    // is logged below that level and leaves the run fine.
+    r.outcome = !r.failures.empty() || r.error_count > 0 ? kOutcomeFailed
+                : s.unchanged                            ? kOutcomeUnchanged
+                : !r.log.empty()                         ? kOutcomeSubmitted
+                : s.submission_off                       ? kOutcomeSubmissionOff
+                                                         : kOutcomeNothingWhitelisted;
   }
   r.ended = Now();
-  const RunState& s = State();
-  r.outcome = !r.failures.empty()  ? kOutcomeFailed
-              : s.unchanged        ? kOutcomeUnchanged
-              : !r.log.empty()     ? kOutcomeSubmitted
-              : s.submission_off   ? kOutcomeSubmissionOff
-                                   : kOutcomeNothingWhitelisted;
   Write(r);
   return r;
 }

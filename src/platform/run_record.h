@@ -60,13 +60,13 @@ void NoteRunFailure(const std::string& why);
 void NoteSubmittedLog(const std::string& file);
 void NoteDayUnchanged();
 void NoteSubmissionOff();
-// Whether a log was submitted in this run, and whether a failure was noted,
-// for the driver's lines.
+// Whether a log was submitted in this run, and whether it failed so far (a
+// failure noted or an error line logged), for the driver's lines.
 bool RunSubmittedLog();
 bool RunHasFailed();
 // Finishes the record and writes it; nothing when no run was begun. The
-// outcome: failed when a failure was noted, else unchanged, submitted,
-// submission-off or nothing-whitelisted.
+// outcome: failed when a failure was noted or an error line logged, else
+// unchanged, submitted, submission-off or nothing-whitelisted.
 std::optional<RunRecord> EndRun();
 
 // The record of the root's last run; nothing when there is none, with the

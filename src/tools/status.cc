@@ -59,7 +59,9 @@ int PrintRunStatus(bool json, double max_age_seconds) {
     const bool running = record->outcome == platform::kOutcomeRunning;
     if (record->outcome == platform::kOutcomeFailed) {
       state = "failed", status = kStatusFailed;
-      why = record->failures.empty() ? "the run failed" : record->failures.front();
+      why = !record->failures.empty() ? record->failures.front()
+            : !record->errors.empty() ? "an error line: " + record->errors.front()
+                                      : "the run failed";
     } else if (running && !ProcessAlive(record->pid)) {
       state = "interrupted", status = kStatusFailed;
       why = "the run stopped before it ended (killed, crashed or the machine went down)";

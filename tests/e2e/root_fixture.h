@@ -18,8 +18,6 @@
 #include "platform/files.h"
 #include "run.h"
 
-
-
 inline const std::string kDomain = "com.velmora.tallybookd.tallyrun";
 inline const std::string kGate = "LastCrashLogSerializationDateInDaysSince1970";
 constexpr int32_t kToday = 20779;  // 2026-11-22
