@@ -208,6 +208,8 @@ TEST(InstallTest, PutsProgramsLibraryAndUnitsInPlace) {
   const auto daily = UnitLines(units + "tallyrun-daily.service");
   EXPECT_TRUE(Has(daily, "[Service]Environment=TALLYRUN_ROOT=" + root));
   EXPECT_TRUE(Has(daily, "[Service]ExecStart=" + tallyrun + " -d"));
+  // The run's record decides the unit's result.
+  EXPECT_TRUE(Has(daily, "[Service]ExecStartPost=/usr/" + std::string(INSTALL_BINDIR) + "/tallybook status"));
   const auto timer = UnitLines(units + "tallyrun-daily.timer");
   EXPECT_TRUE(Has(timer, "[Timer]OnCalendar=daily"));
   EXPECT_TRUE(Has(timer, "[Timer]Persistent=true"));
