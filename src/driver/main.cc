@@ -58,8 +58,11 @@ std::string ModeOf(int argc, char** argv) {
   return arg == "-d" || arg == "-f" || arg == "-t" ? arg : "";
 }
 
-// The line that closes a run: how it went, as the record says.
+// The line that closes a run: how it went, as the record says. Preferences
+// still pending are written first (they would be at exit anyway), so that
+// one that cannot be written counts against the run.
 void LogRunEnd() {
+  platform::Context::Current().SynchronizeAllPreferences();
   const auto record = platform::EndRun();
   if (!record) return;
   std::string line = "run " + record->outcome;

@@ -357,6 +357,37 @@ bool Directory::Append(std::string_view leaf, std::string_view bytes, std::strin
   return true;
 }
 
+bool Directory::Overwrite(std::string_view leaf, std::string_view bytes, std::string* error) {
+  const std::string name(leaf);
+  const int fd = Pass() ? openat(fd_, name.c_str(), O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC) : -1;
+  if (fd < 0) {
+    if (error) *error = ErrnoText("cannot open", PathOf(name), errno);
+    return false;
+  }
+  struct stat st;
+  int err = 0;
+  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || st.st_size < static_cast<off_t>(bytes.size())) {
+    err = EFBIG;
+    if (error) *error = PathOf(name) + " is not a regular file long enough to be written over";
+  } else {
+    size_t done = 0;
+    while (done < bytes.size()) {
+      const ssize_t n = Pass() ? pwrite(fd, bytes.data() + done, bytes.size() - done, static_cast<off_t>(done)) : -1;
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) {
+        err = n < 0 ? errno : ENOSPC;
+        break;
+      }
+      done += static_cast<size_t>(n);
+    }
+    if (!err && (!Pass() || fdatasync(fd) != 0)) err = errno;
+    if (err && error) *error = ErrnoText("cannot write over", PathOf(name), err);
+  }
+  close(fd);
+  errno = err;
+  return err == 0;
+}
+
 bool Directory::MoveTo(std::string_view leaf, const Directory& to, std::string_view new_leaf, std::string* error) {
   const std::string from(leaf), target(new_leaf);
   if (!Pass() || renameat2(fd_, from.c_str(), to.fd_, target.c_str(), RENAME_NOREPLACE) != 0) {

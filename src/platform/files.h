@@ -76,6 +76,11 @@ class Directory {
   // Appends bytes with one write, creating the file (private) when missing;
   // a symbolic link at leaf is refused.
   bool Append(std::string_view leaf, std::string_view bytes, std::string* error);
+  // Writes bytes over the start of the existing regular file leaf, which
+  // must be at least as long, and syncs it: no block is allocated, so it
+  // works on a full disk where a replacement cannot. Not atomic: only for a
+  // file whose reader tells a torn one from a whole one.
+  bool Overwrite(std::string_view leaf, std::string_view bytes, std::string* error);
   // Moves leaf into the directory to under the name new_leaf; fails with
   // EEXIST rather than replace anything.
   bool MoveTo(std::string_view leaf, const Directory& to, std::string_view new_leaf, std::string* error);

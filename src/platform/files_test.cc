@@ -117,6 +117,21 @@ TEST(FilesTest, ModesLinksAndTheThingsInTheWay) {
   ASSERT_EQ(mkfifo((root / "d/fifo").c_str(), 0600), 0);
   EXPECT_FALSE(AppendToFile(root / "d/fifo", "x", &error));  // and it does not block
   EXPECT_EQ(error, root / "d/fifo is not a regular file; refusing to write to it");
+
+  // Writing over a file in place: only over a regular file at least as
+  // long, never through a link, and the tail stays.
+  auto d = Directory::Open(root / "d", false, &error);
+  ASSERT_TRUE(d);
+  ASSERT_TRUE(WriteFileAtomically(root / "d/over", "0123456789"));
+  EXPECT_TRUE(d->Overwrite("over", "abc", &error)) << error;
+  EXPECT_EQ(*ReadFile(root / "d/over"), "abc3456789");
+  EXPECT_FALSE(d->Overwrite("over", "longer than ten", &error));
+  EXPECT_EQ(error, root / "d/over is not a regular file long enough to be written over");
+  EXPECT_FALSE(d->Overwrite("link", "x", &error));
+  EXPECT_EQ(error, "cannot open " + (root / "d/link") + ": Too many levels of symbolic links");
+  EXPECT_FALSE(d->Overwrite("fifo", "", &error));
+  EXPECT_FALSE(d->Overwrite("missing", "x", &error));
+  EXPECT_TRUE(fs::is_empty(outside.path()));
 }
 
 TEST(FilesTest, LeftoverNamesAndTheInstanceLock) {

@@ -31,14 +31,42 @@ RunState& State() {
   return *state;
 }
 
+// Every record file is padded to this size, so that a run on a full disk
+// can still write its end over its start (see Write); quoted lines are cut
+// so that a record fits.
+constexpr size_t kRecordBytes = 16384;
+constexpr size_t kQuotedLineBytes = 256;
+
+std::string Quoted(std::string_view line) {
+  if (line.size() <= kQuotedLineBytes) return std::string(line);
+  size_t cut = kQuotedLineBytes;
+  while (cut > 0 && (static_cast<unsigned char>(line[cut]) & 0xC0) == 0x80) --cut;  // whole characters
+  return std::string(line.substr(0, cut)) + "...";
+}
+
 // Written through the file layer, so privately, atomically and never
-// through a link. A record that cannot be written is one more error line:
-// it cannot fail the run it describes.
+// through a link. When the disk is too full for a replacement, the record
+// is written over the one there (the run's start, or the last run's), whose
+// padding leaves room: a full disk is when a scheduler most needs to hear
+// that the run failed. A record that cannot be written at all is one more
+// error line: it cannot fail the run it describes.
 void Write(const RunRecord& record) {
   std::string bytes, error;
-  if (!cf::WriteXMLPropertyList(record.ToValue(), bytes, &error) ||
-      !WriteFileAtomically(Context::Current().Path(kRunRecordPath), bytes, &error))
+  if (!cf::WriteXMLPropertyList(record.ToValue(), bytes, &error)) {
     LogError("Could not record how the run went: %s", error);
+    return;
+  }
+  if (bytes.size() < kRecordBytes) bytes.append(kRecordBytes - bytes.size(), '\n');
+  const std::string path = Context::Current().Path(kRunRecordPath);
+  if (WriteFileAtomically(path, bytes, &error)) return;
+  std::string in_place_error;
+  const size_t slash = path.rfind('/');
+  auto dir = Directory::Open(path.substr(0, slash), false, &in_place_error);
+  if (dir && dir->Overwrite(path.substr(slash + 1), bytes, &in_place_error)) {
+    LogDefault("Recorded how the run went over the last record: %s", error);
+    return;
+  }
+  LogError("Could not record how the run went: %s", error);
 }
 
 }  // namespace
@@ -117,7 +145,7 @@ void NoteRunDay(int32_t day) {
 
 void NoteRunFailure(const std::string& why) {
   std::lock_guard<std::mutex> lock(State().mu);
-  if (State().failures.size() < kRunRecordQuotedErrors) State().failures.push_back(why);
+  if (State().failures.size() < kRunRecordQuotedErrors) State().failures.push_back(Quoted(why));
 }
 
 void NoteSubmittedLog(const std::string& file) {
@@ -181,7 +209,7 @@ std::optional<RunRecord> ReadRunRecord(std::string* error) {
 void CountErrorLine(std::string_view text) {
   std::lock_guard<std::mutex> lock(State().mu);
   ++State().error_count;
-  if (State().errors.size() < kRunRecordQuotedErrors) State().errors.emplace_back(text);
+  if (State().errors.size() < kRunRecordQuotedErrors) State().errors.push_back(Quoted(text));
 }
 
 }  // namespace platform

@@ -4,7 +4,8 @@
 // parses, every log has its description) and, once a clean run has followed,
 // hold no temporary file and have each day submitted once, except where the
 // gate's order (its record is written after the tasks, whatever they
-// achieved) makes another count unavoidable.
+// achieved) makes another count unavoidable. `tallybook status` tells each
+// faulted run from a good one.
 #include <sqlite3.h>
 
 #include <cstdio>
@@ -112,6 +113,18 @@ class CrashWalkTest : public ::testing::Test {
       const RunResult faulted = RunProgram(TALLYRUN_FAULTS_BIN, {mode}, env);
       EXPECT_EQ(faulted.status, kind == "crash" ? 128 + SIGKILL : 0) << where << faulted.err;
       ExpectWhole(root, where + ", after the fault");
+      // The scheduler hears of it. A kill leaves a run that never ended,
+      // unless it came before the run's first record or after its last; a
+      // failed write fails the run, unless it was the record's own and the
+      // record went over the last one instead.
+      const RunResult status = RunProgram(TALLYBOOK_BIN, {"status"}, Env(root));
+      if (kind == "crash") {
+        EXPECT_TRUE(status.out.rfind("state:    interrupted: ", 0) == 0 ||
+                    status.out.rfind("state:    none: ", 0) == 0 || status.out.find("\nended:") != std::string::npos)
+            << where << "\n" << status.out;
+      } else if (Count(faulted.err, "Recorded how the run went over the last record") == 0) {
+        EXPECT_EQ(status.status, 1) << where << "\n" << status.out << faulted.err;
+      }
       const size_t logs_after_fault = Logs(root).size();
       const bool gate_after_fault = GateRecorded(root);
 
