@@ -131,7 +131,7 @@ TEST(FilesTest, ModesLinksAndTheThingsInTheWay) {
   EXPECT_EQ(error, "cannot open " + (root / "d/link") + ": Too many levels of symbolic links");
   EXPECT_FALSE(d->Overwrite("fifo", "", &error));
   EXPECT_FALSE(d->Overwrite("missing", "x", &error));
-  EXPECT_TRUE(fs::is_empty(outside.path()));
+  EXPECT_FALSE(fs::exists(outside / "t"));
 }
 
 TEST(FilesTest, LeftoverNamesAndTheInstanceLock) {
