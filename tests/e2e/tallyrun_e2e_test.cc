@@ -245,6 +245,7 @@ TEST_F(TallyrunTest, ServiceSingleTurnAndUnsolicitedAppInfo) {
   EXPECT_EQ(Count(r.err, "tallyrun got (unsolicited -- so ignoring) AAI:\n()"), 1u);
   EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
   EXPECT_TRUE(Logs().empty());
+  EXPECT_FALSE(fs::exists(root / "var/tallyrun/last-run.plist")) << "a turn without the day's work records no run";
 
   // Operation 1 runs that day, ungated; a later operation 0 is ignored.
   r = Serve({{"run-day", "20000"}, {"logging-status"}, {"app-data", empty}});
@@ -253,6 +254,10 @@ TEST_F(TallyrunTest, ServiceSingleTurnAndUnsolicitedAppInfo) {
   EXPECT_EQ(Count(r.err, "(unsolicited -- so ignoring) "), 1u);
   EXPECT_TRUE(Pref(kGate).IsNull());
   EXPECT_FALSE(platform::FileExists(root / "var/run/notifications.log"));
+  const cf::Value record = ReadPlist(root / "var/tallyrun/last-run.plist");
+  ASSERT_TRUE(record.AsDictionary());
+  EXPECT_EQ(record.AsDictionary()->Get("mode"), cf::Value("service"));
+  EXPECT_EQ(record.AsDictionary()->Get("day"), cf::Value::SInt32(20000));
 
   // An unknown operation uses up the turn too.
   r = Serve({{"send", "5"}, {"logging-status"}});
