@@ -173,6 +173,7 @@ std::string SupportLibrary() {
 // freezer's writes, as the daily collection would store them.
 int Controller(const std::string& root) {
   platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  if (const auto bad_root = CheckDeviceRoot("devsim")) return *bad_root;
   cf::Dictionary info;
   const cf::Value nand = CopyNANDInfo();
   if (const cf::Dictionary* d = nand.AsDictionary()) info = d->MutableCopy();
@@ -190,6 +191,7 @@ int Controller(const std::string& root) {
 // the health, lab and OTA views and the content-deletion answer.
 int Views(const std::string& root, bool round) {
   platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  if (const auto bad_root = CheckDeviceRoot("devsim")) return *bad_root;
   // The service prints some progress lines on standard output; while the
   // views are gathered they go to standard error, so the output is JSON.
   std::fflush(stdout);
@@ -264,6 +266,7 @@ cf::Dictionary ChannelDelta(const cf::Dictionary& sample) {
 // on stderr.
 int Reporting(const std::string& root, int64_t categories, bool json, double interval) {
   platform::ContextScope scope(root.empty() ? platform::Context::Current().root() : root);
+  if (const auto bad_root = CheckDeviceRoot("devsim")) return *bad_root;
   const std::string& where = scope.context().root();
   std::optional<IOReportError> error;
   const auto fail = [&](const char* what) {

@@ -146,6 +146,12 @@ TEST_F(TallybookTest, AMissingOrUnreadableRootIsAnError) {
   EXPECT_EQ(r.status, 1);
   EXPECT_EQ(r.err, "tallybook: " + plain + " is not a device root (it has no .tallyrun-root and no store); make one "
                    "with: devsim init " + plain + " (and set TALLYRUN_ROOT=" + plain + ")\n");
+  for (const char* look : {"controller", "views", "ioreport"}) {
+    r = RunProgram(DEVSIM_BIN, {look, plain}, env);
+    EXPECT_EQ(r.status, 1) << look;
+    EXPECT_EQ(r.err.rfind("devsim: " + plain + " is not a device root (it has no .tallyrun-root and no store)", 0), 0u)
+        << r.err;
+  }
   EXPECT_FALSE(platform::FileExists(plain + "/var"));
   env["TALLYRUN_ROOT"] = "/";
   r = Tallybook({"dump"});
