@@ -1,7 +1,9 @@
-// Property lists and service messages from outside the process.
+// Property lists and service messages from outside the process, and the
+// run record read back from the root.
 #include <string_view>
 
 #include "cf/plist.h"
+#include "platform/run_record.h"
 #include "platform/service.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -14,6 +16,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
       (void)again;
     }
     (void)parsed.value.Description();
+    if (const auto record = platform::RunRecord::FromValue(parsed.value)) (void)record->ToValue();
   }
   std::string error;
   (void)platform::DecodeServiceMessage(bytes, &error);

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "cf/plist.h"
+#include "platform/run_record.h"
 #include "platform/service.h"
 #include "sim/default_device.h"
 #include "sim/kcdata.h"
@@ -82,6 +83,16 @@ int main(int argc, char** argv) {
   cf::WriteXMLPropertyList(message, bytes, nullptr);
   Seed("plist", "message.xml", bytes);
   Seed("plist", "message.json", R"({"operation": 2, "app_data": [{"bundle_id": "x", "adam_id": -1}]})");
+  platform::RunRecord record;
+  record.mode = "-d";
+  record.day = 20778;
+  record.started = 1795435200;
+  record.ended = 1795435201;
+  record.outcome = "failed";
+  record.errors = {"Couldn't load whitelist"};
+  record.failures = {"the gate record for day 20778 could not be written"};
+  cf::WriteXMLPropertyList(record.ToValue(), bytes, nullptr);
+  Seed("plist", "run-record.xml", bytes);
 
   // Stackshots: the encoder's layout, then the shapes the search must survive.
   auto thread = [](const char* name, int64_t writes) {

@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <cstdint>
 #include <cstring>
 #include <mutex>
 #include <random>
@@ -158,18 +159,10 @@ const FileModes& CurrentFileModes() {
 
 void ApplyPrivateUmask() { umask(CurrentFileModes().has_group ? 027 : 077); }
 
-std::optional<std::string> ReadFile(const std::string& path, std::string* error) {
-  const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) {
-    if (error) *error = ErrnoText("cannot open", path, errno);
-    return std::nullopt;
-  }
-  struct stat st;
-  if (fstat(fd, &st) == 0 && S_ISDIR(st.st_mode)) {
-    close(fd);
-    if (error) *error = "cannot read " + path + ": is a directory";
-    return std::nullopt;
-  }
+namespace {
+
+// Everything an open descriptor holds, up to max_bytes; closes it.
+std::optional<std::string> ReadOpened(int fd, const std::string& path, int64_t max_bytes, std::string* error) {
   std::string out;
   char buf[65536];
   for (;;) {
@@ -182,9 +175,49 @@ std::optional<std::string> ReadFile(const std::string& path, std::string* error)
     }
     if (n == 0) break;
     out.append(buf, static_cast<size_t>(n));
+    if (static_cast<int64_t>(out.size()) > max_bytes) {
+      if (error) *error = path + " is over " + std::to_string(max_bytes) + " bytes; not reading it";
+      close(fd);
+      return std::nullopt;
+    }
   }
   close(fd);
   return out;
+}
+
+}  // namespace
+
+std::optional<std::string> ReadFile(const std::string& path, std::string* error) {
+  const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) {
+    if (error) *error = ErrnoText("cannot open", path, errno);
+    return std::nullopt;
+  }
+  struct stat st;
+  if (fstat(fd, &st) == 0 && S_ISDIR(st.st_mode)) {
+    close(fd);
+    if (error) *error = "cannot read " + path + ": is a directory";
+    return std::nullopt;
+  }
+  return ReadOpened(fd, path, INT64_MAX, error);
+}
+
+std::optional<std::string> ReadRegularFile(const std::string& path, int64_t max_bytes, std::string* error) {
+  // O_NONBLOCK: a FIFO planted at the path must not stall the reader.
+  const int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  if (fd < 0) {
+    if (error)
+      *error = errno == ELOOP ? path + " is a symbolic link; refusing to read through it"
+                              : ErrnoText("cannot open", path, errno);
+    return std::nullopt;
+  }
+  struct stat st;
+  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+    close(fd);
+    if (error) *error = path + " is not a regular file; refusing to read it";
+    return std::nullopt;
+  }
+  return ReadOpened(fd, path, max_bytes, error);
 }
 
 bool FileExists(const std::string& path) {

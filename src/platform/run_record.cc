@@ -1,7 +1,9 @@
 #include "platform/run_record.h"
 
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <climits>
 #include <mutex>
 
@@ -198,8 +200,9 @@ std::optional<RunRecord> EndRun() {
 
 std::optional<RunRecord> ReadRunRecord(std::string* error) {
   const std::string path = Context::Current().Path(kRunRecordPath);
-  if (!FileExists(path)) return std::nullopt;
-  const auto bytes = ReadFile(path, error);
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0 && errno == ENOENT) return std::nullopt;
+  const auto bytes = ReadRegularFile(path, 1 << 20, error);
   if (!bytes) return std::nullopt;
   auto record = RunRecord::FromValue(cf::ParsePropertyList(*bytes).value);
   if (!record && error) *error = path + " is not a run record";

@@ -164,10 +164,22 @@ TEST_F(RunStatusTest, StatusTellsASchedulerWhatItNeeds) {
   s = Status();
   EXPECT_EQ(s.status, 1);
   EXPECT_NE(s.out.find("state:    interrupted: "), std::string::npos) << s.out;
+  // A record that is no record, or not a file the job wrote: said, never
+  // waited on or followed.
   ASSERT_TRUE(platform::WriteFileAtomically(root / kRecord, "<plist"));
   s = Status();
   EXPECT_EQ(s.status, 1);
-  EXPECT_NE(s.out.find("state:    unreadable: "), std::string::npos) << s.out;
+  EXPECT_EQ(s.out, "state:    unreadable: " + root / kRecord + " is not a run record\n");
+  fs::remove(root / kRecord);
+  ASSERT_EQ(mkfifo((root / kRecord).c_str(), 0600), 0);
+  s = Status();
+  EXPECT_EQ(s.out, "state:    unreadable: " + root / kRecord + " is not a regular file; refusing to read it\n");
+  fs::remove(root / kRecord);
+  fs::create_symlink(root / "elsewhere.plist", root / kRecord);
+  WritePlist("elsewhere.plist", record);
+  s = Status();
+  EXPECT_EQ(s.status, 1);
+  EXPECT_EQ(s.out, "state:    unreadable: " + root / kRecord + " is a symbolic link; refusing to read through it\n");
 
   // No root: failed, and nothing is made.
   env["TALLYRUN_ROOT"] = root / "nowhere";
