@@ -12,6 +12,7 @@
 #include <cstring>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/clock.h"
 #include "platform/context.h"
@@ -47,6 +48,23 @@ inline std::optional<int> ParseCommandLine(CLI::App& app, int argc, char** argv)
     app.exit(e);
     return 2;
   }
+  // The parser reads empty text as 0 for a number: an empty --day, --offset
+  // or operation would act on day 0 or now.
+  std::vector<const CLI::App*> apps{&app};
+  for (size_t i = 0; i < apps.size(); ++i)
+    for (const CLI::App* sub : apps[i]->get_subcommands({})) apps.push_back(sub);
+  for (const CLI::App* a : apps)
+    for (const CLI::Option* o : a->get_options()) {
+      const std::string type = o->get_type_name();
+      const bool number = type == "INT" || type == "UINT" || type == "FLOAT" || type == "NUMBER";
+      for (const std::string& r : o->results())
+        if ((number || o->get_name() == "--day") && r.empty()) {
+          const char* slash = std::strrchr(argv[0], '/');
+          std::fprintf(stderr, "%s: %s needs a value, not empty text\n", slash ? slash + 1 : argv[0],
+                       o->get_name().c_str());
+          return 2;
+        }
+    }
   // A mistyped moment would put what the tool reads or writes on the wrong day.
   if (const auto clock_error = platform::ClockOverrideError()) {
     const char* slash = std::strrchr(argv[0], '/');

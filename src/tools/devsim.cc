@@ -360,6 +360,10 @@ int main(int argc, char** argv) {
   if (reporting->parsed()) return Reporting(reporting_root, categories, reporting_json, interval);
   if (init->parsed()) {
     std::error_code ec;
+    if (dir.empty()) {
+      std::fprintf(stderr, "devsim: DIR is empty; name the directory to make the device root in\n");
+      return 2;
+    }
     if (platform::IsProtectedDirectory(dir)) {
       std::fprintf(stderr, "devsim: %s is never a device root; make one in a directory of its own\n", dir.c_str());
       return 2;
@@ -374,7 +378,7 @@ int main(int argc, char** argv) {
     }
     if (force && !ClearOldRoot(dir)) return 2;
     std::string error;
-    const std::string where = std::filesystem::absolute(dir).string();
+    const std::string where = std::filesystem::absolute(dir, ec).string();
     std::vector<std::string> disks;
     if (!(host ? WriteHostRoot(where, SupportLibrary(), &disks, &error)
                : WriteDefaultRoot(where, SupportLibrary(), &error))) {
@@ -382,7 +386,7 @@ int main(int argc, char** argv) {
       return 1;
     }
     if (host && disks.empty()) std::fprintf(stderr, "devsim: this machine shows no disks in /sys/block\n");
-    std::printf("%s\n", std::filesystem::absolute(dir).string().c_str());
+    std::printf("%s\n", where.c_str());
   }
   return 0;
 }

@@ -59,6 +59,10 @@ TEST_F(NewcomerTest, MistakesGetMessagesThatHelp) {
        "tallybook: expected a day number or an ISO date (YYYY-MM-DD), not '2026-1-22'" + day_help},
       // Refused before any connection is tried: there is no service here.
       {TALLYCTL_BIN, {"run-day", "-1"}, "tallyctl: a day before 1970-01-01 cannot be run: -1\n"},
+      {DEVSIM_BIN, {"init", ""}, "devsim: DIR is empty; name the directory to make the device root in\n"},
+      {TALLYBOOK_BIN, {"set", "--day", "", "k", "1"}, "tallybook: --day needs a value, not empty text\n"},
+      {TALLYBOOK_BIN, {"push", "k", "1", "--offset", ""}, "tallybook: --offset needs a value, not empty text\n"},
+      {TALLYCTL_BIN, {"send", ""}, "tallyctl: OPERATION needs a value, not empty text\n"},
       {DEVSIM_BIN, {"snapshot", snapshot, "--header", empty_header},
        "devsim: the snapshot header " + empty_header + " (0 bytes) describes no records; nothing to print\n"},
   };
