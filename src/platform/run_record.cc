@@ -17,15 +17,14 @@ namespace platform {
 
 namespace {
 
+// The record being made; error lines and failures noted before the run
+// begins go into it too.
 struct RunState {
   std::mutex mu;
   bool begun = false;
   bool unchanged = false;
   bool submission_off = false;
   RunRecord record;
-  uint64_t error_count = 0;
-  std::vector<std::string> errors;
-  std::vector<std::string> failures;
 };
 
 RunState& State() {
@@ -133,9 +132,6 @@ void BeginRun() {
     s.record.pid = getpid();
     s.record.outcome = kOutcomeRunning;
     snapshot = s.record;
-    snapshot.error_count = s.error_count;
-    snapshot.errors = s.errors;
-    snapshot.failures = s.failures;
   }
   Write(snapshot);
 }
@@ -147,7 +143,8 @@ void NoteRunDay(int32_t day) {
 
 void NoteRunFailure(const std::string& why) {
   std::lock_guard<std::mutex> lock(State().mu);
-  if (State().failures.size() < kRunRecordQuotedErrors) State().failures.push_back(Quoted(why));
+  std::vector<std::string>& failures = State().record.failures;
+  if (failures.size() < kRunRecordQuotedErrors) failures.push_back(Quoted(why));
 }
 
 void NoteSubmittedLog(const std::string& file) {
@@ -172,7 +169,7 @@ bool RunSubmittedLog() {
 
 bool RunHasFailed() {
   std::lock_guard<std::mutex> lock(State().mu);
-  return !State().failures.empty() || State().error_count > 0;
+  return !State().record.failures.empty() || State().record.error_count > 0;
 }
 
 std::optional<RunRecord> EndRun() {
@@ -182,9 +179,6 @@ std::optional<RunRecord> EndRun() {
     std::lock_guard<std::mutex> lock(s.mu);
     if (!s.begun) return std::nullopt;
     r = s.record;
-    r.error_count = s.error_count;
-    r.errors = s.errors;
-    r.failures = s.failures;
     // An error line is a step that went wrong; what a machine merely lacks
     // is logged below that level and leaves the run fine.
     r.outcome = !r.failures.empty() || r.error_count > 0 ? kOutcomeFailed
@@ -211,8 +205,9 @@ std::optional<RunRecord> ReadRunRecord(std::string* error) {
 
 void CountErrorLine(std::string_view text) {
   std::lock_guard<std::mutex> lock(State().mu);
-  ++State().error_count;
-  if (State().errors.size() < kRunRecordQuotedErrors) State().errors.push_back(Quoted(text));
+  RunRecord& record = State().record;
+  ++record.error_count;
+  if (record.errors.size() < kRunRecordQuotedErrors) record.errors.push_back(Quoted(text));
 }
 
 }  // namespace platform
