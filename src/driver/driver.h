@@ -5,11 +5,12 @@
 #include <cstdint>
 
 #include "cf/value.h"
+#include "platform/run_record.h"
 #include "platform/service.h"
 
 inline constexpr const char* kServiceName = "com.velmora.tallybookd.tallyrun";
 inline constexpr const char* kInstanceLockPath = "/var/run/tallyrun.lock";
-inline constexpr const char* kGateKey = "LastCrashLogSerializationDateInDaysSince1970";
+using platform::kGateKey;
 inline constexpr const char* kLoggingNotification = "com.velmora.tallybookd.tallyrun.logging";
 
 // Operation codes of service messages.

@@ -17,6 +17,11 @@ namespace platform {
 
 inline constexpr const char* kRunRecordPath = "/var/tallyrun/last-run.plist";
 
+// The job's preference domain and, in it, the gate record: the last day a
+// gated run handled. The driver writes it; `tallybook status` reads it.
+inline constexpr const char* kTallyrunDomain = "com.velmora.tallybookd.tallyrun";
+inline constexpr const char* kGateKey = "LastCrashLogSerializationDateInDaysSince1970";
+
 // The outcomes, as the record spells them.
 inline constexpr const char* kOutcomeRunning = "running";
 inline constexpr const char* kOutcomeSubmitted = "submitted";  // an aggregated log was written

@@ -9,13 +9,14 @@
 #include <vector>
 
 #include "cf/value.h"
+#include "platform/run_record.h"
 #include "report/config.h"
 
 namespace platform {
 class TBHistoryDistributionEnumerator;
 }
 
-inline constexpr const char* kTallyrunDomain = "com.velmora.tallybookd.tallyrun";
+using platform::kTallyrunDomain;
 
 class TBReport {
  public:

@@ -18,9 +18,6 @@ namespace tools {
 
 namespace {
 
-constexpr const char* kDomain = "com.velmora.tallybookd.tallyrun";
-constexpr const char* kGateKey = "LastCrashLogSerializationDateInDaysSince1970";
-
 bool ProcessAlive(int64_t pid) { return pid > 0 && (kill(static_cast<pid_t>(pid), 0) == 0 || errno == EPERM); }
 
 std::string Moment(double t) { return platform::LocalStamp(t, "%Y-%m-%d %H:%M:%S %z"); }
@@ -42,7 +39,7 @@ int PrintRunStatus(bool json, double max_age_seconds) {
   const int32_t yesterday = TBDaysSince1970() - 1;
   std::string read_error;
   const auto record = platform::ReadRunRecord(&read_error);
-  const cf::Value gate_value = DGVPreferencesGetValue(kGateKey, kDomain);
+  const cf::Value gate_value = DGVPreferencesGetValue(platform::kGateKey, platform::kTallyrunDomain);
   const cf::Number* gate_number = gate_value.AsNumber();
   const bool gate_ahead = gate_number && gate_number->AsSInt64() > yesterday;
 
