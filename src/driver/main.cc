@@ -146,8 +146,8 @@ int TallyrunMain(int argc, char** argv) {
       RunDailyTasksIfDayChanged(cf::Value());
     }
   } else {
+    // The daily work opens the run's record itself.
     const int32_t today = TBDaysSince1970();
-    platform::BeginRun();
     if (mode == "-d") {
       RunDailyTasksIfDayChanged(cf::Value());
     } else if (mode == "-f") {

@@ -65,8 +65,9 @@ RootCheck CheckDeviceRoot(const std::string& dir) {
     return {RootStatus::kProtected, dir + " is never a device root; " + HowToMake("DIR")};
   // A root that grants no one reading is locked on purpose, even against
   // the superuser, who would otherwise fill it with files of its own.
-  if ((st.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0 || access(dir.c_str(), R_OK | X_OK) != 0) {
-    const int cause = (st.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0 ? EACCES : errno;
+  const bool locked = (st.st_mode & (S_IRUSR | S_IRGRP | S_IROTH)) == 0;
+  if (locked || access(dir.c_str(), R_OK | X_OK) != 0) {
+    const int cause = locked ? EACCES : errno;
     return {RootStatus::kUnreadable, "cannot read the device root " + dir + ": " + std::strerror(cause)};
   }
   if (HasRootMarker(dir) || IsRegularFile(dir + kStoreDevicePath)) return {RootStatus::kRoot, ""};

@@ -19,6 +19,12 @@
 #include "platform/device_root.h"
 #include "platform/files.h"
 
+// The program's name as a person typed it, for its messages.
+inline const char* ProgramName(const char* argv0) {
+  const char* slash = std::strrchr(argv0, '/');
+  return slash ? slash + 1 : argv0;
+}
+
 // Nothing when the program should go on; otherwise its exit status (0 after
 // --help, 2 for a usage error, which CLI11 has already explained).
 // Every tool creates what it creates under the root privately.
@@ -34,9 +40,8 @@ inline std::optional<int> ParseCommandLine(CLI::App& app, int argc, char** argv)
       valid += (valid.empty() ? "" : ", ") + sub->get_name();
     }
     if (!known) {
-      const char* slash = std::strrchr(argv[0], '/');
       std::fprintf(stderr, "%s: unknown subcommand '%s'; the subcommands are: %s (--help for more)\n",
-                   slash ? slash + 1 : argv[0], argv[1], valid.c_str());
+                   ProgramName(argv[0]), argv[1], valid.c_str());
       return 2;
     }
   }
@@ -59,16 +64,14 @@ inline std::optional<int> ParseCommandLine(CLI::App& app, int argc, char** argv)
       const bool number = type == "INT" || type == "UINT" || type == "FLOAT" || type == "NUMBER";
       for (const std::string& r : o->results())
         if ((number || o->get_name() == "--day") && r.empty()) {
-          const char* slash = std::strrchr(argv[0], '/');
-          std::fprintf(stderr, "%s: %s needs a value, not empty text\n", slash ? slash + 1 : argv[0],
+          std::fprintf(stderr, "%s: %s needs a value, not empty text\n", ProgramName(argv[0]),
                        o->get_name().c_str());
           return 2;
         }
     }
   // A mistyped moment would put what the tool reads or writes on the wrong day.
   if (const auto clock_error = platform::ClockOverrideError()) {
-    const char* slash = std::strrchr(argv[0], '/');
-    std::fprintf(stderr, "%s: %s\n", slash ? slash + 1 : argv[0], clock_error->c_str());
+    std::fprintf(stderr, "%s: %s\n", ProgramName(argv[0]), clock_error->c_str());
     return 2;
   }
   return std::nullopt;

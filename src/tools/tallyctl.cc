@@ -118,9 +118,8 @@ int main(int argc, char** argv) {
     if (*parsed < 0) return Fail(2, "a day before 1970-01-01 cannot be run: " + day_text);
     // The service would truncate a larger number to 32 bits and run some
     // other day; a day after today has nothing to run yet.
-    if (*parsed > TBDaysSince1970())
-      return Fail(2, "day " + day_text + " is after today (day " + std::to_string(TBDaysSince1970()) +
-                         "); nothing was sent");
+    if (const int32_t today = TBDaysSince1970(); *parsed > today)
+      return Fail(2, "day " + day_text + " is after today (day " + std::to_string(today) + "); nothing was sent");
     day = *parsed;
   }
   if (const auto status = CheckDeviceRoot("tallyctl")) return *status;
