@@ -349,11 +349,40 @@ bool Directory::Link(const std::string& from, std::string_view to, std::string* 
   return true;
 }
 
-bool Directory::Append(std::string_view leaf, std::string_view bytes, std::string* error) {
+namespace {
+// Where the last whole line of an open file ends: its size when it ends in
+// a newline (or is empty), else just past its last newline, 0 when it has
+// none; -1 when it cannot be read.
+off_t EndOfLastLine(int fd, off_t size) {
+  char buf[4096];
+  for (off_t end = size; end > 0;) {
+    const off_t start = end > static_cast<off_t>(sizeof buf) ? end - static_cast<off_t>(sizeof buf) : 0;
+    const ssize_t n = pread(fd, buf, static_cast<size_t>(end - start), start);
+    if (n != end - start) return -1;
+    for (ssize_t i = n; i > 0; --i)
+      if (buf[i - 1] == '\n') return start + i;
+    end = start;
+  }
+  return 0;
+}
+}  // namespace
+
+namespace {
+// Whether the last search_bytes of an open file hold mark.
+bool TailHolds(int fd, off_t size, std::string_view mark, int64_t search_bytes) {
+  const off_t start = size > search_bytes ? size - search_bytes : 0;
+  std::string tail(static_cast<size_t>(size - start), '\0');
+  const ssize_t n = pread(fd, tail.data(), tail.size(), start);
+  return n > 0 && std::string_view(tail.data(), static_cast<size_t>(n)).find(mark) != std::string_view::npos;
+}
+}  // namespace
+
+bool Directory::Append(std::string_view leaf, std::string_view bytes, std::string* error, AppendOnce* once) {
   const std::string name(leaf);
   const mode_t file_mode = CurrentFileModes().file;
-  // O_NONBLOCK: a FIFO planted at the path must not stall the run.
-  const int fd = Pass() ? openat(fd_, name.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC,
+  // O_NONBLOCK: a FIFO planted at the path must not stall the run. Read
+  // access: the end of the file is checked for a torn line.
+  const int fd = Pass() ? openat(fd_, name.c_str(), O_RDWR | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC,
                                  file_mode)
                         : -1;
   if (fd < 0) {
@@ -375,16 +404,38 @@ bool Directory::Append(std::string_view leaf, std::string_view bytes, std::strin
     fchmod(fd, file_mode);
     ApplyGroup(fd);
   }
+  // A line torn by an earlier run (a disk that filled up under an older
+  // version, a file edited by hand) is cut off, so that the new line does
+  // not grow onto it and every line stays readable.
+  const off_t whole = EndOfLastLine(fd, st.st_size);
+  if (whole < 0 || (whole != st.st_size && ftruncate(fd, whole) != 0)) {
+    const int err = errno;
+    close(fd);
+    if (error) *error = ErrnoText(whole < 0 ? "cannot read" : "cannot repair", PathOf(name), err);
+    errno = err;
+    return false;
+  }
+  if (whole != st.st_size)
+    LogDefault("%s ended in %lld bytes of a torn line; they were cut off", PathOf(name),
+               static_cast<long long>(st.st_size - whole));
+  if (once && !once->mark.empty() && TailHolds(fd, whole, once->mark, once->search_bytes)) {
+    once->present = true;
+    close(fd);
+    return true;
+  }
   ssize_t n = -1;
   if (Pass()) {
     do n = write(fd, bytes.data(), bytes.size());
     while (n < 0 && errno == EINTR);
   }
-  const int err = errno;
+  const int err = n < 0 ? errno : ENOSPC;
+  // Whole or not at all: a short write (a full disk) is taken back.
+  if (n > 0 && n != static_cast<ssize_t>(bytes.size()) && ftruncate(fd, whole) != 0)
+    LogError("Cannot take back a part-written line of %s: %s", PathOf(name), std::strerror(errno));
   close(fd);
   if (n != static_cast<ssize_t>(bytes.size())) {
-    if (error) *error = ErrnoText("cannot write", PathOf(name), n < 0 ? err : ENOSPC);
-    errno = n < 0 ? err : ENOSPC;
+    if (error) *error = ErrnoText("cannot write", PathOf(name), err);
+    errno = err;
     return false;
   }
   return true;
@@ -469,9 +520,9 @@ bool WriteFileAtomically(const std::string& path, std::string_view bytes, std::s
   return true;
 }
 
-bool AppendToFile(const std::string& path, std::string_view bytes, std::string* error) {
+bool AppendToFile(const std::string& path, std::string_view bytes, std::string* error, AppendOnce* once) {
   std::optional<Directory> dir = Directory::Open(ParentOf(path), true, error);
-  return dir && dir->Append(LeafOf(path), bytes, error);
+  return dir && dir->Append(LeafOf(path), bytes, error, once);
 }
 
 ssize_t WriteToDescriptor(int fd, std::string_view bytes) {

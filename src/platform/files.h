@@ -53,6 +53,15 @@ void ApplyPrivateUmask();
 // ELOOP when a link stands there below the root).
 bool MakeDirectories(const std::string& path);
 
+// For a line that must be in a file once: it is not appended when the last
+// search_bytes of the file hold mark (a text only that line carries), and
+// present says so.
+struct AppendOnce {
+  std::string_view mark;
+  int64_t search_bytes = int64_t{8} << 20;
+  bool present = false;
+};
+
 // A directory opened for the *at calls. Below the device root it was reached
 // without following any link.
 class Directory {
@@ -76,9 +85,11 @@ class Directory {
   // Gives the file at from the extra name to; fails with EEXIST rather than
   // replace anything.
   bool Link(const std::string& from, std::string_view to, std::string* error);
-  // Appends bytes with one write, creating the file (private) when missing;
-  // a symbolic link at leaf is refused.
-  bool Append(std::string_view leaf, std::string_view bytes, std::string* error);
+  // Appends a line (bytes ending in a newline) whole or not at all, with one
+  // write, creating the file (private) when missing: a short write is cut
+  // back off, and a torn line found at the end of the file is cut off (and
+  // logged) first. A symbolic link at leaf is refused.
+  bool Append(std::string_view leaf, std::string_view bytes, std::string* error, AppendOnce* once = nullptr);
   // Writes bytes over the start of the existing regular file leaf, which
   // must be at least as long, and syncs it: no block is allocated, so it
   // works on a full disk where a replacement cannot. Not atomic: only for a
@@ -104,8 +115,9 @@ class Directory {
 // mode; an executable mode keeps the owner's execute bit.
 bool WriteFileAtomically(const std::string& path, std::string_view bytes, std::string* error = nullptr,
                          mode_t mode = 0);
-// Appends bytes to path in one write (see Directory::Append).
-bool AppendToFile(const std::string& path, std::string_view bytes, std::string* error = nullptr);
+// Appends a line to path, whole or not at all (see Directory::Append).
+bool AppendToFile(const std::string& path, std::string_view bytes, std::string* error = nullptr,
+                  AppendOnce* once = nullptr);
 
 // One write(2) of bytes to an open descriptor, again after an interruption:
 // the count written, or -1 with errno set.
