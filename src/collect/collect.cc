@@ -59,7 +59,7 @@ void CollectNANDInfo() {
 }
 
 // Step 4: up to ten of the kernel's pending ECC events, each to the
-// structured-data log.
+// structured-data log before the next is read.
 void CollectECCEvents() {
   struct EccEventRecord {
     uint8_t id;
@@ -77,7 +77,9 @@ void CollectECCEvents() {
     // The record holds eight registers; a larger count names no more.
     for (int i = 0; i < std::min<int>(record.count, 8); ++i)
       event.Set("reg" + std::to_string(i), cf::Value::SInt64(record.reg[i]));
-    FKLogStructuredData(172, event);
+    // An event that cannot be recorded is not read past: it stays queued
+    // for the next run (the device lets an event go only at the next read).
+    if (!FKLogStructuredData(172, event)) return;
     // The size keeps what the last read stored, as the kernel's callers do.
     failed = platform::Sysctl("kern.next_ecc_event", &record, &size) != 0;
   }

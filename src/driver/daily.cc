@@ -15,6 +15,7 @@ void RunDailyTasksIfDayChanged(const cf::Value& appInfo) {
   platform::NoteRunDay(yesterday);
   const int64_t last = DGVPreferencesGetIntegerValue(kGateKey, kTallyrunDomain);
   if (last < yesterday) {
+    platform::NoteGatedRun();
     RunDailyTasks(yesterday, appInfo);
     // Recorded after the tasks, whatever they achieved.
     DGVPreferencesSetValue(kGateKey, cf::Value::SInt32(yesterday), kTallyrunDomain);
@@ -30,12 +31,28 @@ void RunDailyTasksIfDayChanged(const cf::Value& appInfo) {
   }
 }
 
+namespace {
+// The aggregated log a gated run already submitted for the day. The gate
+// record is written only after all the tasks, so a gated run that was
+// stopped after its submission comes back to the same day; the submissions
+// folder tells it that the day went out.
+std::optional<platform::Submission> GatedLogOf(int32_t day) {
+  if (!platform::RunIsGated()) return std::nullopt;
+  for (const platform::Submission& s : platform::ListSubmissions("log-aggregated"))
+    if (s.gated && s.day == day) return s;
+  return std::nullopt;
+}
+}  // namespace
+
 void RunDailyTasks(int32_t day, const cf::Value& appInfo) {
   platform::BeginRun();
   platform::NoteRunDay(day);
   LogDefault("daily tasks for day %d", day);
   TBClientCheckpoint();
-  if (DiagnosticLogSubmissionEnabled()) {
+  if (const auto submitted = GatedLogOf(day)) {
+    LogDefault("The aggregated log for day %d went out already (%s); it is not submitted twice", day, submitted->file);
+    platform::NoteSubmittedLog(submitted->file);
+  } else if (DiagnosticLogSubmissionEnabled()) {
     TBReport report;
     report.writeLogForYesterday(day, appInfo);
     if (!platform::RunSubmittedLog() && !platform::RunHasFailed())

@@ -5,6 +5,9 @@
 
 #include <cerrno>
 #include <cstring>
+#include <map>
+#include <mutex>
+#include <string>
 
 #include "cf/plist.h"
 #include "platform/clock.h"
@@ -12,6 +15,8 @@
 #include "platform/files.h"
 #include "platform/log.h"
 #include "platform/profile.h"
+#include "platform/run_record.h"
+#include "platform/diagnostics.h"
 
 bool platform::AnalyticsAvailable() { return Context::Current().analytics_available(); }
 
@@ -31,13 +36,36 @@ bool AnalyticsSendEventLazy(std::string_view event, const std::function<cf::Valu
   record.Set("time", cf::ISO8601(cf::Date{platform::Now()}));
   record.Set("event", std::string(event));
   record.Set("payload", payload());
+  // What a gated run sends is sent once for its day: a run repeated after a
+  // crash sends its events in the same order, finds each (the n-th of its
+  // name for that day) among the last ones and does not send it again.
+  std::string mark;
+  if (const std::optional<int32_t> day = platform::RunDay()) {
+    record.Set("day", cf::Value::SInt32(*day));
+    if (platform::RunIsGated()) {
+      static std::mutex mu;
+      static std::map<std::string, int, std::less<>> sent;
+      int nth;
+      {
+        std::lock_guard<std::mutex> lock(mu);
+        nth = ++sent[std::string(event)];
+      }
+      const std::string id = platform::LineId(std::string(event) + " #" + std::to_string(nth) + " of gated day " +
+                                              std::to_string(*day));
+      record.Set("id", id);
+      mark = "\"id\":\"" + id + "\"";
+    }
+  }
   std::string line, error;
   if (!cf::WriteJSON(record, line, &error)) {
     platform::LogError("Cannot record event %s: %s", std::string(event), error);
     return false;
   }
   line += '\n';
-  const bool ok = platform::AppendToFile(platform::Context::Current().Path("/var/eventlens/events.jsonl"), line, &error);
+  platform::AppendOnce once{mark};
+  const bool ok =
+      platform::AppendToFile(platform::Context::Current().Path("/var/eventlens/events.jsonl"), line, &error, &once);
   if (!ok) platform::LogError("Cannot record event %s: %s", std::string(event), error);
+  if (once.present) platform::LogDefault("Event %s went out already for day %@", std::string(event), record.Get("day"));
   return ok;
 }

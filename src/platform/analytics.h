@@ -1,6 +1,8 @@
 // Event analytics: an event is used when $ROOT/var/eventlens/enabled-events.plist
 // (an array of names, or "*") lists it; accepted events are appended as JSON
-// lines to $ROOT/var/eventlens/events.jsonl.
+// lines to $ROOT/var/eventlens/events.jsonl: {"time", "event", "payload"},
+// with "day" when the run works on a day, and for a gated run an "id" that
+// makes each event go out once for its day.
 #pragma once
 
 #include <functional>

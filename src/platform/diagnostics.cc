@@ -10,10 +10,13 @@
 
 #include <algorithm>
 #include <array>
+#include <climits>
 #include <cmath>
 #include <cstring>
 #include <ctime>
 #include <fstream>
+#include <map>
+#include <mutex>
 #include <random>
 #include <vector>
 
@@ -94,6 +97,10 @@ bool WriteSubmission(std::string_view type, std::string_view name, const cf::Val
   meta.Set("name", std::string(name));
   meta.Set("options", options.AsDictionary() ? options : cf::Value(cf::Dictionary()));
   meta.Set("created", cf::ISO8601(cf::Date{now}));
+  if (const std::optional<int32_t> day = RunDay()) {
+    meta.Set("day", cf::Value::SInt32(*day));
+    meta.Set("gated", cf::Value::Bool(RunIsGated()));
+  }
   std::string json;
   if (!cf::WriteJSON(meta, json, &error, 2)) {
     LogError("Cannot describe the submission of %s: %s", std::string(name), error);
@@ -141,6 +148,37 @@ bool WriteSubmission(std::string_view type, std::string_view name, const cf::Val
 }
 
 }  // namespace
+
+std::vector<Submission> platform::ListSubmissions(std::string_view name) {
+  const std::string dir = Context::Current().Path(kSubmissionsDir);
+  const std::string prefix = std::string(name) + "_", suffix = ".json";
+  std::vector<Submission> found;
+  for (const Entry& e : RegularFiles(dir)) {
+    if (e.name.size() <= prefix.size() + suffix.size() || e.name.compare(0, prefix.size(), prefix) != 0 ||
+        e.name.compare(e.name.size() - suffix.size(), suffix.size(), suffix) != 0)
+      continue;
+    Submission s;
+    s.file = e.name.substr(0, e.name.size() - suffix.size());
+    struct stat st;
+    if (lstat((dir + "/" + s.file).c_str(), &st) != 0 || !S_ISREG(st.st_mode)) continue;
+    const std::optional<std::string> text = ReadRegularFile(dir + "/" + e.name, 64 * 1024);
+    if (!text) continue;
+    const cf::ParseResult parsed = cf::ParseJSON(*text);
+    const cf::Dictionary* d = parsed.value.AsDictionary();
+    const cf::String* logged_name = d ? d->Get("name").AsString() : nullptr;
+    const cf::String* created = d ? d->Get("created").AsString() : nullptr;
+    if (!logged_name || *logged_name != name || !created) continue;
+    const std::optional<double> at = ParseInstant(created->str());
+    if (!at) continue;
+    s.created = *at;
+    if (const cf::Number* day = d->Get("day").AsNumber(); day && day->AsSInt64() >= INT32_MIN && day->AsSInt64() <= INT32_MAX)
+      s.day = static_cast<int32_t>(day->AsSInt64());
+    s.gated = d->Get("gated").AsBool() && *d->Get("gated").AsBool();
+    found.push_back(std::move(s));
+  }
+  std::sort(found.begin(), found.end(), [](const Submission& a, const Submission& b) { return a.created < b.created; });
+  return found;
+}
 
 bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, const cf::Value& options,
                               const cf::Value& /*reserved*/, const std::function<void(LogOutput&)>& writer) {
@@ -271,19 +309,49 @@ std::string DayInName(const std::string& name) {
 }
 }  // namespace
 
+std::string platform::LineId(std::string_view identity) {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  std::string hex;
+  for (const unsigned char c : CC_MD5(identity)) {
+    hex += kDigits[c >> 4];
+    hex += kDigits[c & 15];
+  }
+  return hex;
+}
+
 bool FKLogStructuredData(int type, const cf::Value& record) {
   const double now = Now();
-  cf::Dictionary line;
-  line.Set("time", cf::ISO8601(cf::Date{now}));
-  line.Set("type", cf::Value::SInt32(type));
-  line.Set("record", record);
-  std::string json, error;
-  const std::string path = Context::Current().Path("/var/faultkeep/") + kStructuredPrefix +
-                           LocalStamp(now, "%Y-%m-%d") + kStructuredSuffix;
-  if (!cf::WriteJSON(line, json, &error) || !AppendToFile(path, json + "\n", &error)) {
+  std::string record_json, json, error;
+  if (!cf::WriteJSON(record, record_json, &error)) {
     LogError("Cannot log structured data of type %d: %s", type, error);
     return false;
   }
+  // A record is identified by its type, its content and how many equal
+  // ones this process logged before it: a run repeated after a crash logs
+  // the same records in the same order and finds each in the day's log,
+  // while two equal records of one run (two alike buses) are both kept.
+  std::string identity = std::to_string(type) + " " + record_json;
+  {
+    static std::mutex mu;
+    static std::map<std::string, int> logged;
+    std::lock_guard<std::mutex> lock(mu);
+    identity += " #" + std::to_string(++logged[LineId(identity)]);
+  }
+  const std::string id = LineId(identity);
+  cf::Dictionary line;
+  line.Set("id", id);
+  line.Set("time", cf::ISO8601(cf::Date{now}));
+  line.Set("type", cf::Value::SInt32(type));
+  line.Set("record", record);
+  const std::string path = Context::Current().Path("/var/faultkeep/") + kStructuredPrefix +
+                           LocalStamp(now, "%Y-%m-%d") + kStructuredSuffix;
+  const std::string mark = "\"id\":\"" + id + "\"";
+  AppendOnce once{mark};
+  if (!cf::WriteJSON(line, json, &error) || !AppendToFile(path, json + "\n", &error, &once)) {
+    LogError("Cannot log structured data of type %d: %s", type, error);
+    return false;
+  }
+  if (once.present) LogDefault("Structured data of type %d %s is in today's log already", type, id);
   return true;
 }
 

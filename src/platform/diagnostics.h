@@ -3,10 +3,12 @@
 // service-and-repair log roll.
 #pragma once
 
-#include <functional>
 #include <cstdint>
+#include <functional>
+#include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "cf/value.h"
 
@@ -21,12 +23,29 @@ class LogOutput {
 
 inline constexpr const char* kSubmissionsDir = "/var/diagvault/submissions";
 
+// A log standing in the submissions folder, as its description tells it.
+struct Submission {
+  std::string file;            // the log's file name
+  double created = 0;          // when it was written
+  std::optional<int32_t> day;  // the day the run that wrote it worked on
+  bool gated = false;          // that run went through the once-a-day gate
+};
+// The logs of this name (e.g. "log-aggregated") in the submissions folder
+// that have their description beside them, oldest first. The folder is the
+// record of what went out: a gated run asks it before submitting a day again.
+std::vector<Submission> ListSubmissions(std::string_view name);
+
+// The "id" of an appended line: the MD5 of what identifies it, in hex.
+std::string LineId(std::string_view identity);
+
 }  // namespace platform
 
 // One file per log in $ROOT/var/diagvault/submissions/, named
 // <name>_<YYYY-MM-DD-HHMMSS>.<type> (local time; "-N" before the dot when the
 // name is taken), holding exactly the writer's bytes, with <file>.json beside
-// it. False, and nothing left behind, when it cannot be written.
+// it: {"type", "name", "options", "created"} and, when the run works on a
+// day, "day" and "gated". False, and nothing left behind, when it cannot be
+// written.
 bool DGVWriteLogForSubmission(std::string_view type, std::string_view name, const cf::Value& options,
                               const cf::Value& reserved, const std::function<void(platform::LogOutput&)>& writer);
 
@@ -61,9 +80,11 @@ std::string GetSystemVersion();
 // A fresh random (version 4) UUID in upper case, one per incident.
 std::string GetIncidentID();
 
-// Appends one record as a JSON line {"time", "type", "record"} (data in
-// base64) to $ROOT/var/faultkeep/structured_<YYYY-MM-DD>.jsonl, dated by the
-// platform clock in local time. False (with an error line) when it cannot.
+// Appends one record as a JSON line {"id", "time", "type", "record"} (data
+// in base64) to $ROOT/var/faultkeep/structured_<YYYY-MM-DD>.jsonl, dated by
+// the platform clock in local time, unless the file holds that line already:
+// the "id" stands for the type, the record and how many equal records this
+// process logged before. False (with an error line) when it cannot.
 bool FKLogStructuredData(int type, const cf::Value& record);
 
 // Moves the structured-data logs of days before today from

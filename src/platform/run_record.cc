@@ -76,6 +76,7 @@ cf::Value RunRecord::ToValue() const {
   cf::Dictionary d;
   d.Set("mode", mode);
   if (day) d.Set("day", cf::Value::SInt32(*day));
+  if (gated) d.Set("gated", cf::Value::Bool(true));
   d.Set("started", cf::Date{started});
   if (ended) d.Set("ended", cf::Date{*ended});
   d.Set("outcome", outcome);
@@ -106,6 +107,7 @@ std::optional<RunRecord> RunRecord::FromValue(const cf::Value& value) {
     if (v < INT32_MIN || v > INT32_MAX) return std::nullopt;
     r.day = static_cast<int32_t>(v);
   }
+  r.gated = d->Get("gated").AsBool() && *d->Get("gated").AsBool();
   if (const cf::Number* pid = d->Get("pid").AsNumber()) r.pid = pid->AsSInt64();
   if (const cf::String* log = text("log")) r.log = log->str();
   if (const cf::Number* count = d->Get("errorCount").AsNumber()) r.error_count = count->AsUInt64();
@@ -139,6 +141,21 @@ void BeginRun() {
 void NoteRunDay(int32_t day) {
   std::lock_guard<std::mutex> lock(State().mu);
   State().record.day = day;
+}
+
+void NoteGatedRun() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  State().record.gated = true;
+}
+
+std::optional<int32_t> RunDay() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  return State().record.day;
+}
+
+bool RunIsGated() {
+  std::lock_guard<std::mutex> lock(State().mu);
+  return State().record.gated;
 }
 
 void NoteRunFailure(const std::string& why) {

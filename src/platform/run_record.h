@@ -36,6 +36,7 @@ inline constexpr size_t kRunRecordQuotedErrors = 5;
 struct RunRecord {
   std::string mode;  // "-d", "-f", "-t", "service"
   std::optional<int32_t> day;
+  bool gated = false;  // the day's work went through the once-a-day gate
   double started = 0;
   std::optional<double> ended;  // none while running (or after a crash)
   std::string outcome;
@@ -56,8 +57,12 @@ void SetRunMode(const std::string& mode);
 // "running"; later calls do nothing. The day's work calls it, so a service
 // that only answered a message leaves the last run's record as it was.
 void BeginRun();
-// The day the run works on.
+// The day the run works on, and whether the once-a-day gate let it through
+// (what a gated run submits is submitted once per day; see diagnostics.h).
 void NoteRunDay(int32_t day);
+void NoteGatedRun();
+std::optional<int32_t> RunDay();
+bool RunIsGated();
 // A reason the run failed: a root, store, submission or preference that
 // could not be used. Kept even before BeginRun.
 void NoteRunFailure(const std::string& why);

@@ -6,7 +6,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <optional>
+#include <string>
 #include <string_view>
+#include <utility>
 
 #include "cf/plist.h"
 #include "platform/clock.h"
@@ -80,22 +82,58 @@ std::optional<std::string> EccRecord(const cf::Dictionary& event) {
   return record;
 }
 
-// "kern.next_ecc_event" as the kernel keeps it: each successful read takes
-// the next event of device/ecc-events.plist, and the queue is written back
-// without it before the event is answered, so a consumed event is gone for
-// the next run even after a crash, and never read twice. {"errno": N} as the
-// next item fails that read with N, and is consumed too. No file: 1.
+// Writes the ECC queue back without its first item.
+bool DropFirstEccItem(const cf::Array& items) {
+  cf::Array rest;
+  for (size_t i = 1; i < items.size(); ++i) rest.Append(items[i]);
+  std::string xml, why;
+  if (!cf::WriteXMLPropertyList(cf::Value(rest), xml, &why) ||
+      !WriteFileAtomically(Context::Current().Path(kEccQueue), xml, &why)) {
+    LogError("Cannot consume an ECC event: %s", why);
+    return false;
+  }
+  return true;
+}
+
+// The event the last read handed out, still first in the queue until the
+// caller has kept it.
+struct DeliveredEcc {
+  std::string queue;  // the queue file it came from
+  cf::Value item;
+};
+std::optional<DeliveredEcc>& Delivered() {
+  static std::optional<DeliveredEcc> delivered;
+  return delivered;
+}
+
+// "kern.next_ecc_event" over device/ecc-events.plist. Each successful read
+// yields the next event; the event a read hands out leaves the queue only
+// at the next read, when the caller has recorded it. A run stopped in
+// between finds it again, and the structured-data log keeps a record once
+// a day, so a repeat adds nothing; an event that was read but not recorded
+// (the reading stopped, or the record could not be kept) stays for the next
+// run. {"errno": N} as the next item fails that read with N, and is
+// consumed at once. No file: not handled here.
 int NextEccEvent(void* buffer, size_t* size, bool* handled) {
+  const std::string path = Context::Current().Path(kEccQueue);
   const cf::Value queue = ReadProfileValue(kEccQueue);
   *handled = !queue.IsNull();
+  std::optional<DeliveredEcc> delivered = std::exchange(Delivered(), std::nullopt);
   if (!*handled) return 0;
   const cf::Array* items = queue.AsArray();
   if (!items) {
-    LogError("%s must be an array of events", Context::Current().Path(kEccQueue));
+    LogError("%s must be an array of events", path);
     return Fail(EINVAL);
   }
-  if (items->empty()) return Fail(ENOENT);
-  const cf::Value& next = (*items)[0];
+  cf::Array pending = *items;
+  if (delivered && delivered->queue == path && !pending.empty() && pending[0] == delivered->item) {
+    if (!DropFirstEccItem(pending)) return Fail(EIO);
+    cf::Array rest;
+    for (size_t i = 1; i < pending.size(); ++i) rest.Append(pending[i]);
+    pending = std::move(rest);
+  }
+  if (pending.empty()) return Fail(ENOENT);
+  const cf::Value& next = pending[0];
   std::optional<std::string> bytes;
   int error = 0;
   if (const cf::Data* d = next.AsData()) {
@@ -106,20 +144,12 @@ int NextEccEvent(void* buffer, size_t* size, bool* handled) {
     bytes = EccRecord(*e);
   }
   if (!bytes && !error) {
-    LogError("%s: the next event is not {\"id\", \"count\", \"reg\"}, {\"errno\"} or data; it is skipped",
-             Context::Current().Path(kEccQueue));
+    LogError("%s: the next event is not {\"id\", \"count\", \"reg\"}, {\"errno\"} or data; it is skipped", path);
     error = EINVAL;
   }
-  if (bytes && *size < bytes->size()) return Fail(ENOMEM);  // not consumed: the caller may ask again
-  cf::Array rest;
-  for (size_t i = 1; i < items->size(); ++i) rest.Append((*items)[i]);
-  std::string xml, why;
-  if (!cf::WriteXMLPropertyList(cf::Value(rest), xml, &why) ||
-      !WriteFileAtomically(Context::Current().Path(kEccQueue), xml, &why)) {
-    LogError("Cannot consume an ECC event: %s", why);
-    return Fail(EIO);
-  }
-  if (error) return Fail(error);
+  if (error) return DropFirstEccItem(pending) ? Fail(error) : Fail(EIO);
+  if (*size < bytes->size()) return Fail(ENOMEM);  // not handed out: the caller may ask again
+  Delivered() = DeliveredEcc{path, next};
   return CopyOut(bytes->data(), bytes->size(), buffer, size);
 }
 

@@ -307,6 +307,16 @@ void NLW_WriteLog(std::string_view bug_type, const cf::Value& values) {
     platform::LogDefault("NANDLogWriter:Last written at %@ current %@ :skipped", last, cf::Value(cf::Date{now}));
     return;
   }
+  // The folder is the record of what went out: a log whose run stopped
+  // before it could note the time still starts the week.
+  for (const platform::Submission& s : platform::ListSubmissions("StorageStatus")) {
+    if (now - s.created >= kSevenDays) continue;
+    platform::LogDefault("NANDLogWriter:%@ went out at %@ current %@ :skipped", s.file, cf::Value(cf::Date{s.created}),
+                         cf::Value(cf::Date{now}));
+    UserDefaultsSetValue(cf::Value("SSLastLoggedAt"), cf::Value(cf::Date{s.created}));
+    UserDefaultsSynchronize();
+    return;
+  }
   try {
     const cf::Dictionary* d = values.AsDictionary();
     if (!d) return;

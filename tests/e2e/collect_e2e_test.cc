@@ -68,10 +68,12 @@ TEST_F(CollectRun, EccEventsTenARunEachReadOnce) {
                                                    {"reg0", cf::Value::SInt64(-2)},
                                                    {"reg1", cf::Value::SInt64(int64_t{1} << 40)}})));
   EXPECT_EQ(Count(r.err, "Unexpected errno"), 0u);
-  // The read after the tenth took the eleventh; the next run logs the twelfth.
+  // An event leaves the queue only once it is recorded: the eleventh, read
+  // but not recorded, waits for the next run with the twelfth.
   r = Tallyrun({"-f"});
   records = EccRecords();
-  ASSERT_EQ(records.size(), 11u);
+  ASSERT_EQ(records.size(), 12u);
+  EXPECT_EQ(records[10].Get("id"), cf::Value::SInt32(11));
   EXPECT_EQ(records.back().Get("id"), cf::Value::SInt32(12));
 
   // An unexpected failure is logged once; an empty queue is silent.
@@ -80,7 +82,7 @@ TEST_F(CollectRun, EccEventsTenARunEachReadOnce) {
   EXPECT_EQ(Count(r.err, "<default>: Unexpected errno (5) reading ECC events from kernel\n"), 1u);
   r = Tallyrun({"-f"});
   EXPECT_EQ(Count(r.err, "Unexpected errno"), 0u);
-  EXPECT_EQ(EccRecords().size(), 11u);
+  EXPECT_EQ(EccRecords().size(), 12u);
 }
 
 TEST_F(CollectRun, TheDefaultDeviceGivesItsStorageRecordsAndAWeeklyStatusLog) {
