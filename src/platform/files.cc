@@ -203,8 +203,18 @@ std::optional<std::string> ReadFile(const std::string& path, std::string* error)
 }
 
 std::optional<std::string> ReadRegularFile(const std::string& path, int64_t max_bytes, std::string* error) {
+  // Below the root the directories are opened without following a link too.
+  std::optional<Directory> dir;
+  const std::string& root = Context::Current().root();
+  if (path.size() > root.size() + 1 && path.compare(0, root.size(), root) == 0 && path[root.size()] == '/' &&
+      root != "/") {
+    const size_t slash = path.rfind('/');
+    dir = Directory::Open(path.substr(0, slash), false, error);
+    if (!dir) return std::nullopt;
+  }
   // O_NONBLOCK: a FIFO planted at the path must not stall the reader.
-  const int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+  const int flags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC;
+  const int fd = dir ? openat(dir->fd(), path.substr(path.rfind('/') + 1).c_str(), flags) : open(path.c_str(), flags);
   if (fd < 0) {
     if (error)
       *error = errno == ELOOP ? path + " is a symbolic link; refusing to read through it"

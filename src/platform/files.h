@@ -25,7 +25,8 @@ namespace platform {
 // The whole file, or nothing when it cannot be read (reason in *error).
 std::optional<std::string> ReadFile(const std::string& path, std::string* error = nullptr);
 // The same for a file the job keeps for itself: only a regular file (not a
-// link, FIFO or device) of at most max_bytes.
+// link, FIFO or device) of at most max_bytes, reached below the root through
+// no link.
 std::optional<std::string> ReadRegularFile(const std::string& path, int64_t max_bytes, std::string* error = nullptr);
 bool FileExists(const std::string& path);
 // The size of a file in bytes (stat), or nothing when it cannot be stat'ed.

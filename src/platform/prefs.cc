@@ -23,6 +23,10 @@ std::string Preferences::PathFor(std::string_view domain) const {
   return directory_ + "/" + std::string(domain) + ".plist";
 }
 
+namespace {
+constexpr int64_t kMaxPreferenceFileBytes = int64_t{16} << 20;
+}  // namespace
+
 Preferences::Domain* Preferences::Load(std::string_view domain) {
   if (!IsValidPreferenceDomain(domain)) {
     LogError("Invalid preference domain \"%s\"", std::string(domain));
@@ -35,7 +39,7 @@ Preferences::Domain* Preferences::Load(std::string_view domain) {
   // Read fresh, but only when the file changed since we last looked.
   const std::string path = PathFor(domain);
   struct stat st;
-  if (stat(path.c_str(), &st) != 0) {
+  if (lstat(path.c_str(), &st) != 0) {
     // No file (any more): nothing on disk; pending changes stay pending.
     d.on_disk = cf::Dictionary();
     d.mtime_ns = d.size = -1;
@@ -50,7 +54,8 @@ Preferences::Domain* Preferences::Load(std::string_view domain) {
   d.inode = st.st_ino;
   d.on_disk = cf::Dictionary();
   std::string error;
-  const auto bytes = ReadFile(path, &error);
+  // Never through a link: a domain linked to a file elsewhere is not read.
+  const auto bytes = ReadRegularFile(path, kMaxPreferenceFileBytes, &error);
   cf::ParseResult parsed;
   if (bytes) parsed = cf::ParsePropertyList(*bytes);
   else parsed.error = error;
@@ -59,8 +64,11 @@ Preferences::Domain* Preferences::Load(std::string_view domain) {
     d.bad_file_reported = false;
   } else if (!d.bad_file_reported) {
     // Read as empty; the file is left as it is until a later write.
-    LogError("Preferences file %s is not a property-list dictionary (%s); reading it as empty", path,
-             parsed.ok() ? "root is " + cf::TypeNameWithArticle(parsed.value.type()) : parsed.error);
+    if (bytes)
+      LogError("Preferences file %s is not a property-list dictionary (%s); reading it as empty", path,
+               parsed.ok() ? "root is " + cf::TypeNameWithArticle(parsed.value.type()) : parsed.error);
+    else
+      LogError("Preferences file %s cannot be read (%s); reading it as empty", path, parsed.error);
     d.bad_file_reported = true;
   }
   return &d;

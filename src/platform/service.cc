@@ -52,6 +52,15 @@ constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
 size_t g_open_peers = 0;
 uint64_t g_poll_calls = 0;
 
+// A descriptor held back while a listener is watched. Out of descriptors,
+// it is given up to accept a waiting peer, so that a message queued on the
+// socket is served rather than dropped at the idle exit; it is taken back
+// when a peer goes.
+int g_reserve_fd = -1;
+void HoldReserveDescriptor() {
+  if (g_reserve_fd < 0) g_reserve_fd = open("/dev/null", O_RDONLY | O_CLOEXEC);
+}
+
 // Connections the run loop watches, in the order they were resumed.
 std::vector<xpc_connection_t>& Watched() {
   static std::vector<xpc_connection_t> watched;
@@ -157,7 +166,10 @@ void XPCConnection::Close() {
   if (fd_ < 0) return;
   close(fd_);
   fd_ = -1;
-  if (!listener_) --g_open_peers;
+  if (!listener_) {
+    --g_open_peers;
+    HoldReserveDescriptor();
+  }
   // Remove the socket only while it is still ours: another instance may
   // have replaced it meanwhile.
   struct stat st;
@@ -169,7 +181,13 @@ void XPCConnection::Close() {
 bool XPCConnection::OnReady() {
   auto self = shared_from_this();  // a handler may cancel us
   if (listener_) {
-    const int peer = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+    int peer = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+    if (peer < 0 && (errno == EMFILE || errno == ENFILE) && g_reserve_fd >= 0) {
+      close(g_reserve_fd);
+      g_reserve_fd = -1;
+      peer = accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+      if (peer >= 0) LogDefault("Out of file descriptors: a service connection took the one held in reserve");
+    }
     if (peer < 0) {
       if (errno == EINTR || errno == EAGAIN || errno == ECONNABORTED) return false;
       if (!accept_failing_)
@@ -401,6 +419,7 @@ void xpc_connection_set_target_queue(const xpc_connection_t&) {}
 void xpc_connection_resume(const xpc_connection_t& connection) {
   if (!connection || connection->resumed_ || connection->fd_ < 0) return;
   connection->resumed_ = true;
+  if (connection->listener_) HoldReserveDescriptor();
   Watched().push_back(connection);
 }
 
@@ -415,7 +434,17 @@ int32_t CFRunLoopRunInMode(double seconds, bool returnAfterSourceHandled) {
   const auto deadline = Clock::now() + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
   for (;;) {
     const auto now = Clock::now();
-    if (now >= deadline) return kCFRunLoopRunTimedOut;
+    if (now >= deadline) {
+      // A peer waiting on a paused listener is tried once more before the
+      // wait ends, as the service may be about to leave.
+      for (const auto& c : std::vector<xpc_connection_t>(Watched())) {
+        if (!c->listener_ || c->fd_ < 0 || c->paused_until_ <= now || g_open_peers >= kMaxServiceConnections)
+          continue;
+        pollfd waiting{c->fd_, POLLIN, 0};
+        if (poll(&waiting, 1, 0) == 1 && c->OnReady()) return kCFRunLoopRunHandledSource;
+      }
+      return kCFRunLoopRunTimedOut;
+    }
     std::vector<xpc_connection_t> sources = Watched();
     if (sources.empty()) {
       // The main queue is always a source of the main run loop, so an empty

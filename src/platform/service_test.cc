@@ -249,16 +249,19 @@ TEST(ServiceTest, ConnectionsBeyondTheCapWaitInTheBacklog) {
   EXPECT_EQ(server.messages, kMaxServiceConnections + 2);
 }
 
-TEST(ServiceTest, OutOfDescriptorsTheListenerPausesInsteadOfSpinning) {
+TEST(ServiceTest, OutOfDescriptorsQueuedMessagesAreServedAndTheListenerPausesInsteadOfSpinning) {
   TempDir root;
   auto log = std::make_shared<CaptureLog>();
   ContextScope scope(root.path(), Backends{nullptr, log});
   Server server;
   ASSERT_NE(server.listener, nullptr);
-  const int client = Connect(ServiceSocketPath(kName));
-  ASSERT_GE(client, 0);
   const std::string frame = GoodFrame();
-  ASSERT_EQ(write(client, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  int clients[2];
+  for (int& client : clients) {
+    client = Connect(ServiceSocketPath(kName));
+    ASSERT_GE(client, 0);
+    ASSERT_EQ(write(client, frame.data(), frame.size()), static_cast<ssize_t>(frame.size()));
+  }
 
   // Use up every descriptor, so accept fails with EMFILE.
   rlimit saved;
@@ -266,21 +269,34 @@ TEST(ServiceTest, OutOfDescriptorsTheListenerPausesInsteadOfSpinning) {
   rlimit low = saved;
   low.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 256);
   ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
+  const int null_fd = open("/dev/null", O_RDONLY | O_CLOEXEC);
+  ASSERT_GE(null_fd, 0);
   std::vector<int> filler;
-  for (int fd; (fd = dup(client)) >= 0;) filler.push_back(fd);
+  for (int fd; (fd = dup(null_fd)) >= 0;) filler.push_back(fd);
+  // The first peer gets the descriptor held in reserve; the second waits,
+  // and the listener pauses rather than spin.
   const uint64_t polls = testing::ServicePollCalls();
-  EXPECT_EQ(CFRunLoopRunInMode(0.5, true), kCFRunLoopRunTimedOut);
+  EXPECT_EQ(CFRunLoopRunInMode(0.5, false), kCFRunLoopRunTimedOut);
   const uint64_t spent = testing::ServicePollCalls() - polls;
-  for (int fd : filler) close(fd);
-  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
+  EXPECT_EQ(server.messages, 1u);
   // A spinning loop polls hundreds of thousands of times in half a second;
   // pausing 100 ms after each failure polls about twice per pause.
   EXPECT_LE(spent, 30u) << spent;
   EXPECT_EQ(log->Count("Cannot accept a service connection (Too many open files); pausing the listener"), 1u);
-
-  close(client);
+  // When the first peer goes, its descriptor is the reserve again, and the
+  // waiting one is served, still at the limit.
+  close(clients[0]);
+  filler.push_back(dup(null_fd));  // the test shares the process: stay at the limit
+  ASSERT_GE(filler.back(), 0);
+  EXPECT_EQ(CFRunLoopRunInMode(0.5, false), kCFRunLoopRunTimedOut);
+  EXPECT_EQ(server.messages, 2u);
+  EXPECT_EQ(log->Count("Out of file descriptors: a service connection took the one held in reserve"), 2u);
+  for (int fd : filler) close(fd);
+  close(null_fd);
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
+  close(clients[1]);
   server.Drain();
-  EXPECT_EQ(server.messages, 1u);  // served once descriptors are free again
+  EXPECT_EQ(server.messages, 2u);
 }
 
 TEST(ServiceTest, AFrameHoldsOnlyTheBytesThatArrived) {

@@ -1,6 +1,7 @@
 #include "platform/store.h"
 
 #include <sqlite3.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cctype>
@@ -95,8 +96,23 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
   } else if (!FileExists(path)) {
     return fail("no store at " + path);
   }
+  // The store, its write-ahead log and its shared-memory index are used
+  // only where they stand: a link planted at any of them (or at a directory
+  // below the root) would send the job's writes elsewhere.
+  const size_t slash = path.find_last_of('/');
+  std::string why;
+  if (slash != std::string::npos && slash > 0 && !Directory::Open(path.substr(0, slash), false, &why))
+    return fail("cannot open store " + path + ": " + why);
+  for (const char* suffix : {"", "-wal", "-shm"}) {
+    struct stat st;
+    const std::string file = path + suffix;
+    if (lstat(file.c_str(), &st) != 0) continue;
+    if (S_ISLNK(st.st_mode)) return fail(file + " is a symbolic link; refusing to open the store through it");
+    if (!S_ISREG(st.st_mode)) return fail(file + " is not a regular file; refusing to open the store");
+  }
   sqlite3* db = nullptr;
-  const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | (mode == Mode::kCreate ? SQLITE_OPEN_CREATE : 0);
+  const int flags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_NOFOLLOW |
+                    (mode == Mode::kCreate ? SQLITE_OPEN_CREATE : 0);
   if (sqlite3_open_v2(path.c_str(), &db, flags, nullptr) != SQLITE_OK) {
     std::string why = AccessProblem(path);
     if (why.empty()) why = db ? sqlite3_errmsg(db) : "out of memory";

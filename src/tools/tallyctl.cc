@@ -106,6 +106,8 @@ int main(int argc, char** argv) {
   auto* send = app.add_subcommand("send", "Send any operation code");
   send->add_option("OPERATION", operation)->required();
   auto* value_opt = send->add_option("--value", value, "the message's \"value\"");
+  bool raw = false;
+  send->add_flag("--raw", raw, "send an operation code the service does not know (it still takes the service's turn)");
   auto* show = app.add_subcommand("show", "Print a submitted log (a property list) as JSON");
   show->add_option("FILE", file)->required();
   if (const auto status = ParseCommandLine(app, argc, argv)) return *status;
@@ -116,12 +118,23 @@ int main(int argc, char** argv) {
     const auto parsed = ParseDay(day_text, &error);
     if (!parsed) return Fail(2, error);
     if (*parsed < 0) return Fail(2, "a day before 1970-01-01 cannot be run: " + day_text);
+    // The service takes a day as a signed 32-bit number and would cut a
+    // larger one down to some other day.
+    if (*parsed > std::numeric_limits<int32_t>::max())
+      return Fail(2, "day " + day_text + " is beyond the last day the service can take (" +
+                         std::to_string(std::numeric_limits<int32_t>::max()) + "); nothing was sent");
     // The service would truncate a larger number to 32 bits and run some
     // other day; a day after today has nothing to run yet.
     if (const int32_t today = TBDaysSince1970(); *parsed > today)
       return Fail(2, "day " + day_text + " is after today (day " + std::to_string(today) + "); nothing was sent");
     day = *parsed;
   }
+  // The service acts on the first message other than app data and ignores
+  // the rest: a mistyped code would use up its turn without a word.
+  if (send->parsed() && !raw && (operation < 0 || operation > 2))
+    return Fail(2, "operation " + std::to_string(operation) +
+                       " is none the service knows (0 logging-status, 1 run-day, 2 app-data); it would still take "
+                       "the service's one turn; give --raw to send it anyway");
   if (const auto status = CheckDeviceRoot("tallyctl")) return *status;
 
   cf::Dictionary message;

@@ -41,7 +41,6 @@ TEST_F(NewcomerTest, MistakesGetMessagesThatHelp) {
        "tallybook: expected a day number or an ISO date (YYYY-MM-DD), not '2026-11-31'" + day_help},
       // Nothing to run yet, or a day the service would truncate to another.
       {TALLYCTL_BIN, {"run-day", "2026-11-23"}, "tallyctl: day 2026-11-23 is after today (day 20779); nothing was sent\n"},
-      {TALLYCTL_BIN, {"run-day", "4294987073"}, "tallyctl: day 4294987073 is after today (day 20779); nothing was sent\n"},
       {TALLYBOOK_BIN, {"frob"},
        "tallybook: unknown subcommand 'frob'; the subcommands are: set, add, push, dump, history, plot, today, status "
        "(--help for more)\n"},
@@ -63,6 +62,11 @@ TEST_F(NewcomerTest, MistakesGetMessagesThatHelp) {
       {TALLYBOOK_BIN, {"set", "--day", "", "k", "1"}, "tallybook: --day needs a value, not empty text\n"},
       {TALLYBOOK_BIN, {"push", "k", "1", "--offset", ""}, "tallybook: --offset needs a value, not empty text\n"},
       {TALLYCTL_BIN, {"send", ""}, "tallyctl: OPERATION needs a value, not empty text\n"},
+      {TALLYCTL_BIN, {"run-day", "4294987073"},
+       "tallyctl: day 4294987073 is beyond the last day the service can take (2147483647); nothing was sent\n"},
+      {TALLYCTL_BIN, {"send", "3"},
+       "tallyctl: operation 3 is none the service knows (0 logging-status, 1 run-day, 2 app-data); it would "
+       "still take the service's one turn; give --raw to send it anyway\n"},
       {DEVSIM_BIN, {"snapshot", snapshot, "--header", empty_header},
        "devsim: the snapshot header " + empty_header + " (0 bytes) describes no records; nothing to print\n"},
   };

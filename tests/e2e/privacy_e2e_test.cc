@@ -5,6 +5,8 @@
 #include <pwd.h>
 #include <sys/stat.h>
 
+#include "platform/run_record.h"
+#include "platform/store.h"
 #include "root_fixture.h"
 
 namespace {
@@ -106,6 +108,11 @@ TEST_F(PrivacyTest, LinksPlantedInTheRootAreNeverWrittenThrough) {
   TempDir outside;
   const std::string target = outside / "target";
   ASSERT_TRUE(platform::WriteFileAtomically(target, "untouched"));
+  // A gate domain elsewhere that would hold every day back, were it read.
+  const std::string gate = outside / "gate.plist";
+  ASSERT_TRUE(platform::WriteFileAtomically(
+      gate, "<plist version=\"1.0\"><dict><key>" + std::string(platform::kGateKey) +
+                "</key><integer>99999</integer></dict></plist>"));
   const std::string events = root / "var/eventlens/events.jsonl";
   const std::string prefs = root / ("Library/Preferences/" + kDomain + ".plist");
   fs::remove(events);
@@ -113,21 +120,46 @@ TEST_F(PrivacyTest, LinksPlantedInTheRootAreNeverWrittenThrough) {
   fs::create_directories(fs::path(events).parent_path());
   fs::create_directories(fs::path(prefs).parent_path());
   fs::create_symlink(target, events);
-  fs::create_symlink(target, prefs);
+  fs::create_symlink(gate, prefs);
   // A directory on the way that is a link: nothing may land in it.
   fs::remove_all(root / "var/run");
   fs::create_directory(outside / "run");
   fs::create_directory_symlink(outside / "run", root / "var/run");
 
-  const RunResult r = Tallyrun({"-f"});
+  const RunResult r = Tallyrun({"-d"});
   EXPECT_GE(Count(r.err, events + " is a symbolic link; refusing to write through it"), 1u) << r.err;
+  EXPECT_GE(Count(r.err, prefs + " is a symbolic link; refusing to read through it"), 1u);
   EXPECT_GE(Count(r.err, prefs + " is a symbolic link; refusing to replace it"), 1u);
   EXPECT_EQ(Count(r.err, "<default>: tallyrun ended\n"), 1u);
-  EXPECT_EQ(Logs().size(), 1u);  // the rest of the run completed
+  EXPECT_EQ(Logs().size(), 1u);  // the gate was not read from elsewhere; the rest of the run completed
   EXPECT_EQ(*platform::ReadFile(target), "untouched");
   EXPECT_TRUE(fs::is_empty(outside / "run"));
   EXPECT_TRUE(fs::is_symlink(events));
   EXPECT_TRUE(fs::is_symlink(prefs));
+
+  // The store, its write-ahead log or its index linked elsewhere: the store
+  // is not opened, and nothing is written beside the link's target.
+  const fs::path store = root / std::string(platform::kStoreDevicePath).substr(1);
+  const fs::path moved = fs::path(outside.path()) / "store" / "TBDataStore.sqlitedb";
+  fs::create_directory(moved.parent_path());
+  for (const char* part : {"-wal", "-shm"})
+    if (fs::exists(store.string() + part)) fs::remove(store.string() + part);  // the run closed the store
+  fs::rename(store, moved);
+  const auto bytes = platform::ReadFile(moved);
+  for (const char* link : {"", "-wal", "-shm"}) {
+    SCOPED_TRACE(link);
+    const fs::path at = store.string() + link;
+    if (*link) fs::rename(moved, store);
+    fs::create_symlink(*link ? fs::path(outside / "elsewhere") : moved, at);
+    const RunResult linked = Tallyrun({"-f"});
+    EXPECT_GE(Count(linked.err, at.string() + " is a symbolic link; refusing to open the store through it"), 1u)
+        << linked.err;
+    fs::remove(at);
+    if (*link) fs::rename(store, moved);
+  }
+  EXPECT_EQ(platform::ReadFile(moved), bytes);
+  EXPECT_EQ(std::distance(fs::directory_iterator(moved.parent_path()), fs::directory_iterator()), 1);  // no -wal, -shm
+  EXPECT_FALSE(fs::exists(outside / "elsewhere"));
 }
 
 TEST_F(PrivacyTest, AnUnprivilegedUserRunsTheWholeJobOnItsOwnRoot) {

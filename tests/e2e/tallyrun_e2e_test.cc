@@ -259,12 +259,12 @@ TEST_F(TallyrunTest, ServiceSingleTurnAndUnsolicitedAppInfo) {
   EXPECT_EQ(record.AsDictionary()->Get("mode"), cf::Value("service"));
   EXPECT_EQ(record.AsDictionary()->Get("day"), cf::Value::SInt32(20000));
 
-  // An unknown operation uses up the turn too.
-  r = Serve({{"send", "5"}, {"logging-status"}});
+  // An unknown operation (sent on purpose) uses up the turn too.
+  r = Serve({{"send", "5", "--raw"}, {"logging-status"}});
   EXPECT_EQ(Count(r.err, "notified of logging status"), 0u);
   EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
   // The low 32 bits decide: 2^32 + 1 is operation 1.
-  r = Serve({{"send", "4294967297", "--value", "20001"}});
+  r = Serve({{"send", "4294967297", "--value", "20001", "--raw"}});
   EXPECT_EQ(Count(r.err, "daily tasks for day 20001"), 1u);
 }
 
