@@ -130,6 +130,10 @@ std::unique_ptr<TallyStore> TallyStore::Open(const std::string& path, Mode mode,
     if (!st || sqlite3_step(st.get()) != SQLITE_ROW) {
       const std::string why = AccessProblem(path);
       if (!why.empty()) return fail("cannot open store " + path + ": " + why);
+      // A full disk or a failing one is no verdict on the file.
+      const int code = sqlite3_errcode(db);
+      if (code == SQLITE_IOERR || code == SQLITE_FULL || code == SQLITE_CANTOPEN)
+        return fail("cannot read store " + path + ": " + sqlite3_errmsg(db) + " (is the disk full?)");
       return fail(path + " is not a Tallybook store (" + sqlite3_errmsg(db) + ")");
     }
     foreign_tables = sqlite3_column_int(st.get(), 0);
