@@ -66,6 +66,6 @@ bool AnalyticsSendEventLazy(std::string_view event, const std::function<cf::Valu
   const bool ok =
       platform::AppendToFile(platform::Context::Current().Path("/var/eventlens/events.jsonl"), line, &error, &once);
   if (!ok) platform::LogError("Cannot record event %s: %s", std::string(event), error);
-  if (once.present) platform::LogDefault("Event %s went out already for day %@", std::string(event), record.Get("day"));
+  if (once.present) platform::LogInfo("Event %s went out already for day %@", std::string(event), record.Get("day"));
   return ok;
 }

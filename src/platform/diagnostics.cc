@@ -351,7 +351,7 @@ bool FKLogStructuredData(int type, const cf::Value& record) {
     LogError("Cannot log structured data of type %d: %s", type, error);
     return false;
   }
-  if (once.present) LogDefault("Structured data of type %d %s is in today's log already", type, id);
+  if (once.present) LogInfo("Structured data of type %d %s is in today's log already", type, id);
   return true;
 }
 

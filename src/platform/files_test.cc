@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -132,6 +133,53 @@ TEST(FilesTest, ModesLinksAndTheThingsInTheWay) {
   EXPECT_FALSE(d->Overwrite("fifo", "", &error));
   EXPECT_FALSE(d->Overwrite("missing", "x", &error));
   EXPECT_FALSE(fs::exists(outside / "t"));
+}
+
+TEST(FilesTest, AppendedLinesAreWholeOrAbsent) {
+  TempDir root;
+  auto log = std::make_shared<CaptureLog>();
+  ContextScope scope(root.path(), Backends{nullptr, log});
+  const std::string path = root / "var/lines.jsonl";
+  // A torn line left by someone else is cut off before the next one; a
+  // file of nothing but a fragment is emptied.
+  for (const auto& [before, after] : std::vector<std::pair<std::string, std::string>>{
+           {"one\ntw", "one\nnext\n"}, {"fragment", "next\n"}, {"", "next\n"}, {"one\n", "one\nnext\n"}}) {
+    ASSERT_TRUE(WriteFileAtomically(path, before));
+    EXPECT_TRUE(AppendToFile(path, "next\n"));
+    EXPECT_EQ(*ReadFile(path), after) << before;
+  }
+  EXPECT_EQ(log->Count(path + " ended in 2 bytes of a torn line; they were cut off"), 1u);
+  EXPECT_EQ(log->Count(path + " ended in 8 bytes of a torn line; they were cut off"), 1u);
+
+  // A write cut short (here by a file size limit, as a full disk would) is
+  // taken back whole.
+  ASSERT_TRUE(WriteFileAtomically(path, "one\n"));
+  const pid_t pid = fork();
+  if (pid == 0) {
+    signal(SIGXFSZ, SIG_IGN);
+    const rlimit limit{10, 10};
+    std::string error;
+    _exit(setrlimit(RLIMIT_FSIZE, &limit) == 0 && !AppendToFile(path, "a line too long\n", &error) &&
+                  error == "cannot write " + path + ": No space left on device"
+              ? 0
+              : 1);
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  EXPECT_EQ(*ReadFile(path), "one\n");
+
+  // A line marked as one of a kind is not appended when the file's tail
+  // holds its mark; only the tail is searched.
+  AppendOnce once{"\"id\":\"7\""};
+  EXPECT_TRUE(AppendToFile(path, "{\"id\":\"7\"}\n", nullptr, &once));
+  EXPECT_FALSE(once.present);
+  EXPECT_TRUE(AppendToFile(path, "{\"id\":\"7\"}\n", nullptr, &once));
+  EXPECT_TRUE(once.present);
+  AppendOnce near{"\"id\":\"7\"", 4};
+  EXPECT_TRUE(AppendToFile(path, "{\"id\":\"7\"}\n", nullptr, &near));
+  EXPECT_FALSE(near.present);
+  EXPECT_EQ(*ReadFile(path), "one\n{\"id\":\"7\"}\n{\"id\":\"7\"}\n");
 }
 
 TEST(FilesTest, LeftoverNamesAndTheInstanceLock) {

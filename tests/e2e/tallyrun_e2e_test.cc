@@ -54,6 +54,24 @@ TEST_F(TallyrunTest, GatedRunHappensOncePerDay) {
   EXPECT_EQ(Count(r.err, "<default>: Day unchanged since last run\n"), 1u);
   EXPECT_EQ(Count(r.err, "daily tasks"), 0u);
   EXPECT_EQ(Logs().size(), 1u);
+  // The gate record lost (a run stopped before writing it): the folder
+  // says the day went out, so the day's other work runs and nothing more is
+  // submitted. A forced run's log does not count.
+  const cf::Value description = cf::ParseJSON(*platform::ReadFile(Logs()[0] + ".json")).value;
+  EXPECT_EQ(description.AsDictionary()->Get("day"), cf::Value::SInt32(kToday - 1));
+  EXPECT_EQ(description.AsDictionary()->Get("gated"), cf::Value::Bool(true));
+  const std::string gated_log = fs::path(Logs()[0]).filename();
+  Tallyrun({"-f"});
+  ASSERT_EQ(Logs().size(), 2u);
+  fs::remove(root / ("Library/Preferences/" + kDomain + ".plist"));
+  r = Tallyrun({"-d"});
+  EXPECT_EQ(Count(r.err, "<default>: The aggregated log for day 20778 went out already (" + gated_log +
+                             "); it is not submitted twice\n"),
+            1u)
+      << r.err;
+  EXPECT_EQ(Count(r.err, "daily tasks for day 20778"), 1u);
+  EXPECT_EQ(Logs().size(), 2u);
+  EXPECT_EQ(Pref(kGate), cf::Value::SInt32(kToday - 1));
 
   // A gate record ahead of the clock (the clock was set back) counts as unchanged.
   env["TALLYRUN_NOW"] = "2026-11-20T15:00:00Z";
