@@ -2,6 +2,9 @@
 
 #include <sqlite3.h>
 
+#include <climits>
+#include <cstdio>
+
 #include "platform/context.h"
 #include "platform/files.h"
 #include "platform/log.h"
@@ -51,6 +54,33 @@ bool ReadFailed(sqlite3* db, int rc) {
   return false;
 }
 
+// What a column holds that is not a number of the kind wanted; empty when
+// it is one. Integers must be stored as integers; reals may be either.
+std::string NotANumber(sqlite3_stmt* s, int column, bool integer) {
+  switch (sqlite3_column_type(s, column)) {
+    case SQLITE_INTEGER: return {};
+    case SQLITE_FLOAT: {
+      if (!integer) return {};
+      char text[64];
+      std::snprintf(text, sizeof text, "%.15g", sqlite3_column_double(s, column));
+      return std::string("the real ") + text;
+    }
+    case SQLITE_TEXT: {
+      std::string text(reinterpret_cast<const char*>(sqlite3_column_text(s, column)),
+                       static_cast<size_t>(sqlite3_column_bytes(s, column)));
+      if (text.size() > 40) text = text.substr(0, 40) + "...";
+      return "the text \"" + text + "\"";
+    }
+    case SQLITE_BLOB: return "a blob of " + std::to_string(sqlite3_column_bytes(s, column)) + " bytes";
+    default: return "nothing (NULL)";
+  }
+}
+
+void TellBadRow(const BadRowHandler& bad, const std::string& sentence) {
+  if (bad) bad(sentence);
+  else LogError("%s", sentence);
+}
+
 StatementPtr Prepare(sqlite3* db, const std::string& sql) {
   sqlite3_stmt* s = nullptr;
   const int rc = sqlite3_prepare_v2(db, sql.c_str(), -1, &s, nullptr);
@@ -70,16 +100,31 @@ void BindRange(sqlite3_stmt* s, std::string_view prefix, int32_t min_day, int32_
 }  // namespace
 
 bool TBHistoryDistributionEnumerator::getNextValue(double* value, int32_t* secondsInDayOffset) {
-  if (done_ || !stmt_) return false;
-  const int rc = sqlite3_step(stmt_);
-  if (rc != SQLITE_ROW) {
-    done_ = true;
-    if (rc != SQLITE_DONE) error_ = rc;
-    return false;
+  while (!done_ && stmt_) {
+    const int rc = sqlite3_step(stmt_);
+    if (rc != SQLITE_ROW) {
+      done_ = true;
+      if (rc != SQLITE_DONE) error_ = rc;
+      return false;
+    }
+    std::string what = NotANumber(stmt_, 0, false);
+    if (!what.empty()) what += ", not a number";
+    const int64_t offset = sqlite3_column_int64(stmt_, 1);
+    if (what.empty()) {
+      const std::string odd = NotANumber(stmt_, 1, true);
+      if (!odd.empty() || offset < INT32_MIN || offset > INT32_MAX)
+        what = (odd.empty() ? std::to_string(offset) : odd) + " as its offset, not a 32-bit second of the day";
+    }
+    if (!what.empty()) {
+      TellBadRow(bad_, "The store's sample of " + key_ + " on day " + std::to_string(day_) + " holds " + what +
+                           "; it is skipped");
+      continue;
+    }
+    if (value) *value = sqlite3_column_double(stmt_, 0);
+    if (secondsInDayOffset) *secondsInDayOffset = static_cast<int32_t>(offset);
+    return true;
   }
-  if (value) *value = sqlite3_column_double(stmt_, 0);
-  if (secondsInDayOffset) *secondsInDayOffset = sqlite3_column_int(stmt_, 1);
-  return true;
+  return false;
 }
 
 std::unique_ptr<TBHistory> TBHistory::initWithDefaultPath(std::string* error) {
@@ -114,6 +159,11 @@ bool TBHistory::scalarsForKeyPrefix(std::string_view prefix, int32_t minDaysSinc
   while ((rc = sqlite3_step(rows.get())) == SQLITE_ROW) {
     key.assign(reinterpret_cast<const char*>(sqlite3_column_text(rows.get(), 0)),
                static_cast<size_t>(sqlite3_column_bytes(rows.get(), 0)));
+    if (const std::string what = NotANumber(rows.get(), 2, true); !what.empty()) {
+      TellBadRow(bad_, "The store's scalar " + key + " of day " + std::to_string(sqlite3_column_int(rows.get(), 1)) +
+                           " holds " + what + ", not a 64-bit integer; it is skipped");
+      continue;
+    }
     bool stop = false;
     rowHandler(key, sqlite3_column_int(rows.get(), 1), sqlite3_column_int64(rows.get(), 2), &stop);
     if (stop) return true;
@@ -137,9 +187,10 @@ bool TBHistory::distributionsForKeyPrefix(std::string_view prefix, int32_t minDa
                static_cast<size_t>(sqlite3_column_bytes(rows.get(), 1)));
     sqlite3_reset(samples.get());
     sqlite3_bind_int64(samples.get(), 1, sqlite3_column_int64(rows.get(), 0));
-    TBHistoryDistributionEnumerator enumerator(samples.get());
+    const int32_t day = sqlite3_column_int(rows.get(), 2);
+    TBHistoryDistributionEnumerator enumerator(samples.get(), key, day, bad_);
     bool stop = false;
-    rowHandler(key, sqlite3_column_int(rows.get(), 2), enumerator, &stop);
+    rowHandler(key, day, enumerator, &stop);
     if (enumerator.error_ != 0) return ReadFailed(db_, enumerator.error_);
     if (stop) return true;
   }

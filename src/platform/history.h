@@ -17,16 +17,26 @@ namespace platform {
 
 class TallyStore;
 
+// Told of a row that holds what its column cannot mean (text or a blob
+// where a number is kept, a real out of an integer's range, planted by
+// hand or by another program): the sentence says which row and what it
+// holds. The row is left out of what the handlers see.
+using BadRowHandler = std::function<void(const std::string& sentence)>;
+
 class TBHistoryDistributionEnumerator {
  public:
   // False when no sample is left, or when the store could not be read: the
-  // history call then reports the failure.
+  // history call then reports the failure. A bad sample is skipped.
   bool getNextValue(double* value, int32_t* secondsInDayOffset);
 
  private:
   friend class TBHistory;
-  explicit TBHistoryDistributionEnumerator(sqlite3_stmt* stmt) : stmt_(stmt) {}
+  TBHistoryDistributionEnumerator(sqlite3_stmt* stmt, const std::string& key, int32_t day, const BadRowHandler& bad)
+      : stmt_(stmt), key_(key), day_(day), bad_(bad) {}
   sqlite3_stmt* stmt_;
+  const std::string& key_;
+  int32_t day_;
+  const BadRowHandler& bad_;
   bool done_ = false;
   int error_ = 0;  // the SQLite result that ended the samples early
 };
@@ -41,6 +51,9 @@ class TBHistory {
   static std::unique_ptr<TBHistory> initWithDefaultPath(std::string* error = nullptr);
   static std::unique_ptr<TBHistory> initWithPath(const std::string& path, std::string* error = nullptr);
   ~TBHistory();
+
+  // Where bad rows are told; by default each is one error line.
+  void setBadRowHandler(BadRowHandler handler) { bad_ = std::move(handler); }
 
   // Rows of the days after min, up to and including max (min < day <= max),
   // whose key starts with prefix, ordered by day, then key: the report asks
@@ -60,6 +73,7 @@ class TBHistory {
   explicit TBHistory(std::unique_ptr<TallyStore> store);
   std::unique_ptr<TallyStore> store_;
   sqlite3* db_;
+  BadRowHandler bad_;
 };
 
 }  // namespace platform

@@ -59,6 +59,9 @@ std::unique_ptr<platform::TBHistory> OpenHistory() {
   std::string error;
   auto history = platform::TBHistory::initWithDefaultPath(&error);
   if (!history) std::fprintf(stderr, "tallybook: %s\n", error.c_str());
+  else history->setBadRowHandler([](const std::string& sentence) {
+    std::fprintf(stderr, "tallybook: warning: %s\n", sentence.c_str());
+  });
   return history;
 }
 

@@ -322,9 +322,37 @@ TEST_F(TallyrunTest, OneBadValueNeverCostsTheDay) {
   // A listed key the log cannot carry, left in the store by an older writer.
   StoreSQL(root.path(), "INSERT INTO scalars VALUES(20778, 'com.velmora.wifi.Bad' || char(1), 5);"
                         "INSERT INTO series(day, key) VALUES(20778, 'com.velmora.net.Bad' || char(65535));"
-                        "INSERT INTO samples SELECT id, 1, 2.5, 0 FROM series WHERE key LIKE 'com.velmora.net.Bad%'");
+                        "INSERT INTO samples SELECT id, 1, 2.5, 0 FROM series WHERE key LIKE 'com.velmora.net.Bad%';"
+  // Values of a type their column cannot mean, as another program could
+  // leave them: each row is skipped with one error line, and shown by the
+  // tools with a warning, never as 0 or the largest integer.
+                        "INSERT INTO scalars VALUES(20778, 'com.velmora.bad.Blob', x'0102');"
+                        "INSERT INTO scalars VALUES(20778, 'com.velmora.bad.Huge', 1.5e300);"
+                        "INSERT INTO scalars VALUES(20778, 'com.velmora.bad.Text', 'abc');"
+                        "INSERT INTO series(day, key) VALUES(20778, 'com.velmora.bad.Samples');"
+                        "INSERT INTO samples SELECT id, 1, 'x', 0 FROM series WHERE key = 'com.velmora.bad.Samples';"
+                        "INSERT INTO samples SELECT id, 2, 1.5, 5e9 FROM series WHERE key = 'com.velmora.bad.Samples';"
+                        "INSERT INTO samples SELECT id, 3, 2.5, 7 FROM series WHERE key = 'com.velmora.bad.Samples';");
+  const std::vector<std::string> bad_rows = {
+      "The store's scalar com.velmora.bad.Blob of day 20778 holds a blob of 2 bytes, not a 64-bit integer; it is skipped\n",
+      "The store's scalar com.velmora.bad.Huge of day 20778 holds the real 1.5e+300, not a 64-bit integer; it is "
+      "skipped\n",
+      "The store's scalar com.velmora.bad.Text of day 20778 holds the text \"abc\", not a 64-bit integer; it is "
+      "skipped\n",
+      "The store's sample of com.velmora.bad.Samples on day 20778 holds the text \"x\", not a number; it is skipped\n",
+      "The store's sample of com.velmora.bad.Samples on day 20778 holds 5000000000 as its offset, not a "
+      "32-bit second of the day; it is skipped\n"};
+  const RunResult dump =
+      RunProgram(TALLYBOOK_BIN, {"dump", "--day", "20778", "--prefix", "com.velmora.bad."}, env);
+  EXPECT_EQ(dump.status, 0);
+  EXPECT_EQ(dump.out, "20778 com.velmora.bad.Samples 1 2.5 2.5 2.5\n");
+  std::string warned;
+  for (const std::string& line : bad_rows) warned += "tallybook: warning: " + line;
+  EXPECT_EQ(dump.err, warned);
   RunResult r = Tallyrun({"-f"});
   ASSERT_EQ(Logs().size(), 1u) << r.err;
+  // (The report reads the samples of listed keys only.)
+  for (size_t i = 0; i < 3; ++i) EXPECT_EQ(Count(r.err, "<error>: " + bad_rows[i]), 1u) << bad_rows[i];
   EXPECT_EQ(Count(r.err, "<error>: Skipping a store key that a property list cannot carry: control character U+0001 "
                          "at byte 20\n"),
             1u);
