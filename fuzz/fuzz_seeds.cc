@@ -327,5 +327,260 @@ int main(int argc, char** argv) {
   Seed("block_stat", "too-few", "1 2 3 4 5 6 7 8 9 10");
   Seed("block_stat", "overflow", "0 0 18446744073709551616 0 0 0 0 0 0 0 0");
   Seed("block_stat", "junk", "1 2 3 4 5 6 x 8 9 10 11");
+
+  auto binary = [](const cf::Value& v) {
+    std::string out;
+    cf::WriteBinaryPropertyList(v, out, nullptr);
+    return out;
+  };
+  auto numbers = [](std::initializer_list<std::pair<const char*, int64_t>> entries) {
+    cf::Dictionary d;
+    for (const auto& [k, v] : entries) d.Set(k, cf::Value::SInt64(v));
+    return cf::Value(d);
+  };
+
+  // controller.plist: the default controller, raw answers with the failure
+  // switches, and descriptions each list encoder must refuse.
+  const std::string default_controller = xml(device.controller);
+  Seed("controller_lists", "default.xml", default_controller);
+  Seed("controller_lists", "default.bplist", binary(device.controller));
+  Seed("controller_lists", "truncated.xml", default_controller.substr(0, default_controller.size() / 2));
+  cf::Dictionary raw_answers;
+  const std::string complete_ftl = sim::CompleteFtlBuffer(), complete_msp = sim::CompleteMspBuffer();
+  raw_answers.Set("stats", cf::Value::Bytes(cf::Data(complete_ftl.begin(), complete_ftl.end())));
+  raw_answers.Set("msp", cf::Array({cf::Value::Bytes(cf::Data(complete_msp.begin(), complete_msp.end())), "x"}));
+  raw_answers.Set("bandStats", cf::Value::Bytes(cf::Data(validity.begin(), validity.end())));
+  raw_answers.Set("defects", lists.Get("defects"));
+  raw_answers.Set("failCommands", cf::Array({cf::Value::SInt32(15)}));
+  raw_answers.Set("failDataCommands", cf::Array({cf::Value::SInt32(17), cf::Value::Float64(13.0)}));
+  raw_answers.Set("contentDeletion", cf::Value::SInt64(7));
+  Seed("controller_lists", "raw-and-failing", xml(raw_answers));
+  cf::Dictionary short_answers = lists.MutableCopy();
+  short_answers.Set("shortData", numbers({{"13", 100}, {"11", -5}, {"15", 1 << 20}}));
+  short_answers.Set("contentDeletion", cf::Value::Bytes(cf::Data(3, 9)));
+  Seed("controller_lists", "short-data", xml(short_answers));
+  cf::Dictionary refused;
+  refused.Set("stats", numbers({{"hostWrites", -1}}));
+  refused.Set("msp", cf::Array({numbers({{"noSuchField", 1}}), cf::Value(cf::Array())}));
+  refused.Set("bandStats", numbers({{"extra", 4294967295}}));
+  refused.Set("defects", cf::Dictionary::Of({{"defects", cf::Array({numbers({{"Bus", 65536}})})}}));
+  refused.Set("telemetry",
+              cf::Dictionary::Of({{"0", cf::Dictionary::Of({{"buses", "x"}})},
+                                  {"1", cf::Dictionary::Of({{"buses", cf::Array({cf::Value(cf::Dictionary::Of(
+                                                                          {{"words", numbers({{"01", 1}})}}))})}})},
+                                  {"2", cf::Dictionary::Of({{"buses", cf::Array({numbers({{"RD", -2147483649}})})}})}}));
+  Seed("controller_lists", "refused-fields", xml(refused));
+  cf::Dictionary odd_lists;
+  odd_lists.Set("bandStats", cf::Dictionary::Of({{"extra", cf::Value::SInt64(3)},
+                                                 {"entries", cf::Array({numbers({{"list", -1}, {"value", -7}}),
+                                                                        numbers({{"value", 4}}),
+                                                                        numbers({{"list", 15}}),
+                                                                        numbers({{"list", 16}})})}}));
+  odd_lists.Set("defects", cf::Dictionary::Of({{"factoryCount", cf::Value::UInt64(4294967295)}}));
+  odd_lists.Set("telemetry", cf::Dictionary::Of({{"0", cf::Dictionary()}, {"1", cf::Value::Bytes(cf::Data(8, 1))}}));
+  odd_lists.Set("stats", "not a list");
+  odd_lists.Set("msp", cf::Dictionary());
+  Seed("controller_lists", "odd-lists", xml(odd_lists));
+  Seed("controller_lists", "not-a-dictionary.xml", xml(cf::Array({device.controller})));
+
+  // The hub: flags, the registry's length, the registry, then the values.
+  auto hub_input = [&](uint8_t flags, const std::string& registry, const std::string& values) {
+    return std::string(1, static_cast<char>(flags)) + BigEndian(registry.size(), 2) + registry + values;
+  };
+  const std::string default_registry = xml(device.registry), default_values = xml(device.ioreport);
+  Seed("hub", "default", hub_input(0, default_registry, default_values));
+  Seed("hub", "default-unknown-twice", hub_input(3, default_registry, default_values));
+  Seed("hub", "default-binary", hub_input(0, binary(device.registry), binary(device.ioreport)));
+  Seed("hub", "no-values", hub_input(0, default_registry, ""));
+  Seed("hub", "cut-registry", hub_input(0, default_registry.substr(0, default_registry.size() - 40), default_values));
+  auto hub_registry = [&](const cf::Dictionary& hub_properties, const cf::Value& legend) {
+    return xml(cf::Array({cf::Value(cf::Dictionary::Of({{"class", "IOReportHub"},
+                                                         {"id", cf::Value::UInt64(1)},
+                                                         {"userClient", "hub"},
+                                                         {"properties", hub_properties}})),
+                          cf::Value(cf::Dictionary::Of({{"class", "PMGR"},
+                                                         {"id", cf::Value::UInt64(0x20)},
+                                                         {"properties",
+                                                          cf::Dictionary::Of({{"IOReportLegend", legend}})}}))}));
+  };
+  auto channel_type = [](uint8_t format, uint16_t elements) {
+    return cf::Value::SInt64(static_cast<int64_t>(format | (0x100ull << 16) | (uint64_t{elements} << 32)));
+  };
+  const cf::Value small_legend = cf::Array({cf::Value(cf::Dictionary::Of(
+      {{"IOReportGroupName", "G"},
+       {"IOReportChannels", cf::Array({cf::Value(cf::Array({cf::Value::SInt64(1), channel_type(1, 1), "One"})),
+                                       cf::Value(cf::Array({cf::Value::SInt64(2), channel_type(2, 3)})),
+                                       cf::Value(cf::Array({cf::Value::SInt64(3), channel_type(4, 0)})),
+                                       cf::Value(cf::Array({cf::Value::SInt64(4), "type"})),
+                                       cf::Value(cf::Array({cf::Value::SInt64(5)}))})}}))});
+  const cf::Value odd_values = cf::Dictionary::Of(
+      {{"32", cf::Dictionary::Of({{"1", "text"},
+                                  {"2", cf::Array({cf::Value(cf::Dictionary::Of(
+                                                       {{"values", cf::Array({cf::Value::SInt64(1)})},
+                                                        {"time", cf::Value::Float64(1e300)}})),
+                                                   cf::Value(cf::Array({cf::Value::SInt64(-1), cf::Value::SInt64(2),
+                                                                        cf::Value::SInt64(3), cf::Value::SInt64(4),
+                                                                        cf::Value::SInt64(5)})),
+                                                   cf::Value::SInt64(9), cf::Value::SInt64(10)})},
+                                  {"3", cf::Value::UInt64(UINT64_MAX)}})},
+       {"x", cf::Value::SInt64(1)}});
+  Seed("hub", "odd-values", hub_input(0, hub_registry(cf::Dictionary(), small_legend), xml(odd_values)));
+  Seed("hub", "fails-interests",
+       hub_input(0, hub_registry(cf::Dictionary::Of({{"failSelectors", cf::Array({cf::Value::SInt64(2)})}}),
+                                 small_legend),
+                 xml(odd_values)));
+  Seed("hub", "fails-map",
+       hub_input(1, hub_registry(cf::Dictionary::Of({{"failMap", cf::Value::Bool(true)}}), small_legend), ""));
+  cf::Array wide;
+  for (int64_t id = 1; id <= 17; ++id) wide.Append(cf::Array({cf::Value::SInt64(id), channel_type(1, 0xFFFF)}));
+  Seed("hub", "over-the-buffer-limit",
+       hub_input(0, hub_registry(cf::Dictionary(),
+                                 cf::Array({cf::Value(cf::Dictionary::Of({{"IOReportChannels", wide}}))})),
+                 ""));
+  Seed("hub", "values-not-a-dictionary", hub_input(2, default_registry, xml(cf::Array({device.ioreport}))));
+
+  // ean.plist: the default images, then figures the driver must refuse.
+  const std::string default_ean = xml(device.ean);
+  Seed("ean", "default.xml", default_ean);
+  Seed("ean", "default.bplist", binary(device.ean));
+  Seed("ean", "truncated.xml", default_ean.substr(0, default_ean.size() - 30));
+  cf::Dictionary odd_images;
+  odd_images.Set("dBIC", "not an image");
+  odd_images.Set("dLTH", numbers({{"size", -1}, {"updates", 2}}));
+  odd_images.Set("ifw1", cf::Dictionary::Of({{"size", cf::Value::Float64(1.5)}, {"updates", "often"}}));
+  odd_images.Set("dCfg", cf::Dictionary());
+  odd_images.Set("fCfg", cf::Dictionary::Of({{"size", cf::Value::UInt64(UINT64_MAX)}}));
+  odd_images.Set(std::string("\x01\x02\x03\x04", 4), numbers({{"size", 5}}));
+  odd_images.Set("ab", numbers({{"size", 6}}));
+  Seed("ean", "odd-images.bplist", binary(odd_images));
+  Seed("ean", "not-a-dictionary.xml", xml(cf::Array({device.ean})));
+
+  // stackshot.plist: the default tasks, then descriptions the encoder must
+  // refuse and ones whose search is easy to get wrong.
+  const std::string default_stackshot = xml(device.stackshot);
+  Seed("stackshot", "default.xml", default_stackshot);
+  Seed("stackshot", "default.bplist", binary(device.stackshot));
+  Seed("stackshot", "truncated.xml", default_stackshot.substr(0, default_stackshot.size() - 25));
+  Seed("stackshot", "fixtures.xml", xml(tasks));
+  Seed("stackshot", "swapout-twice.xml",
+       xml(cf::Array({task("kernel_task", {thread("VM_swapout", -1), thread("VM_swapout", 8192)}),
+                      task("VM_swapout", {thread("VM_swapou", 1), thread("VM_swapout_", 2)})})));
+  cf::Dictionary huge_writes;
+  huge_writes.Set("name", "VM_swapout");
+  huge_writes.Set("diskWrites", cf::Value::UInt64(UINT64_MAX));
+  Seed("stackshot", "huge-writes.xml", xml(cf::Array({task("k", {cf::Value(huge_writes)}), task("empty", {})})));
+  cf::Dictionary no_threads;
+  no_threads.Set("name", "launchd");
+  Seed("stackshot", "no-threads.xml", xml(cf::Array({cf::Value(no_threads)})));
+  Seed("stackshot", "long-name.xml", xml(cf::Array({task("k", {thread(std::string(64, 'n').c_str(), 1)})})));
+  const cf::Value nul_in_name = cf::Dictionary::Of({{"name", std::string("VM_swapout\0x", 12)}});
+  Seed("stackshot", "nul-in-name.bplist", binary(cf::Array({task("k", {nul_in_name})})));
+  const cf::Value negative_writes =
+      cf::Dictionary::Of({{"name", "t"}, {"threads", cf::Array({numbers({{"diskWrites", -5}})})}});
+  Seed("stackshot", "negative-writes.xml", xml(cf::Array({task("k", {thread("VM_swapout", -1)}), negative_writes})));
+  cf::Dictionary real_writes;
+  real_writes.Set("name", "VM_swapout");
+  real_writes.Set("diskWrites", cf::Value::Float64(4096.5));
+  Seed("stackshot", "real-writes.xml", xml(cf::Array({task("k", {cf::Value(real_writes)})})));
+  const cf::Value unknown_key =
+      cf::Dictionary::Of({{"name", "k"}, {"threads", cf::Array()}, {"pid", cf::Value::SInt64(1)}});
+  Seed("stackshot", "unknown-key.xml", xml(cf::Array({unknown_key})));
+  Seed("stackshot", "threads-not-an-array.xml",
+       xml(cf::Array({cf::Value(cf::Dictionary::Of({{"name", "k"}, {"threads", "VM_swapout"}}))})));
+  Seed("stackshot", "not-an-array.xml", xml(cf::Dictionary::Of({{"name", "kernel_task"}})));
+  cf::Array many;
+  for (int t = 0; t < 40; ++t)
+    many.Append(task(("task" + std::to_string(t)).c_str(),
+                     {thread("main", t), thread(t == 39 ? "VM_swapout" : "worker", 1000 + t)}));
+  Seed("stackshot", "many-tasks.bplist", binary(many));
+
+  // usage.plist, dated from the clock of fuzz_usage (1.75e9, mid-afternoon
+  // UTC), with the target's own "baseline" and "names" keys.
+  constexpr double kUsageNow = 1.75e9;
+  const cf::Value today = cf::Date{kUsageNow - 3600}, yesterday = cf::Date{kUsageNow - 86400},
+                  last_week = cf::Date{kUsageNow - 7 * 86400};
+  auto usage_record = [](const char* proc, const cf::Value& since, int64_t wifi_in, int64_t wifi_out,
+                         int64_t wwan_in, int64_t wwan_out) {
+    return cf::Value(cf::Dictionary::Of({{"procName", proc},
+                                         {"sinceTime", since},
+                                         {"wifiInBytes", cf::Value::SInt64(wifi_in)},
+                                         {"wifiOutBytes", cf::Value::SInt64(wifi_out)},
+                                         {"wwanInBytes", cf::Value::SInt64(wwan_in)},
+                                         {"wwanOutBytes", cf::Value::SInt64(wwan_out)}}));
+  };
+  cf::Dictionary maps = *usage_record("Maps", today, 5 << 20, 300 << 10, 0, 2048).AsDictionary();
+  maps.Set("bundleName", "com.example.maps");
+  const cf::Array usage_records({usage_record("mDNSResponder", yesterday, 1 << 20, 1 << 19, 4096, 1023), maps,
+                                 usage_record("nsurlsessiond", last_week, 1 << 30, 1 << 20, 0, 0)});
+  auto baseline_entry = [](const cf::Value& since, int64_t a, int64_t b, int64_t c, int64_t d) {
+    return cf::Value(cf::Array({since, cf::Value::SInt64(a), cf::Value::SInt64(b), cf::Value::SInt64(c),
+                                cf::Value::SInt64(d)}));
+  };
+  auto usage_file = [&](std::initializer_list<std::pair<const char*, cf::Value>> entries) {
+    return cf::Value(cf::Dictionary::Of(entries));
+  };
+  Seed("usage", "records.xml", xml(usage_file({{"records", usage_records}, {"delaySeconds", cf::Value::SInt64(0)},
+                                               {"neverReply", cf::Value::Bool(false)}})));
+  Seed("usage", "records.bplist", binary(usage_file({{"records", usage_records}})));
+  const cf::Value baseline = cf::Dictionary::Of(
+      {{"mDNSResponder", baseline_entry(yesterday, 1 << 19, 1 << 19, 8192, 0)},  // grew, shrank
+       {"com.example.maps", baseline_entry(yesterday, 1, 1, 1, 1)},             // a new start date
+       {"nsurlsessiond", baseline_entry(last_week, INT64_MIN, 0, 0, INT64_MAX)},
+       {"gone", baseline_entry(today, 1, 2, 3, 4)}});
+  Seed("usage", "with-baseline.xml", xml(usage_file({{"records", usage_records}, {"baseline", baseline}})));
+  const cf::Value hostile_baseline = cf::Dictionary::Of(
+      {{"mDNSResponder", cf::Array({yesterday, cf::Value::SInt64(1)})},
+       {"com.example.maps", cf::Array({cf::Value::SInt64(1), cf::Value::SInt64(2), cf::Value::SInt64(3),
+                                       cf::Value::SInt64(4), cf::Value::SInt64(5)})},
+       {"nsurlsessiond", baseline_entry(last_week, 1, 2, 3, 4).AsArray()->MutableCopy()}});
+  Seed("usage", "hostile-baseline.xml", xml(usage_file({{"records", usage_records}, {"baseline", hostile_baseline}})));
+  Seed("usage", "baseline-not-a-dictionary.xml",
+       xml(usage_file({{"records", usage_records}, {"baseline", cf::Array({baseline})}})));
+  Seed("usage", "named.xml",
+       xml(usage_file({{"records", usage_records}, {"names", cf::Array({"mDNSResponder", "Maps", "absent"})}})));
+  auto records_and = [&](const char* key, const cf::Value& value) {
+    return xml(usage_file({{"records", usage_records}, {key, value}}));
+  };
+  Seed("usage", "never-reply.xml", records_and("neverReply", cf::Value::Bool(true)));
+  Seed("usage", "delayed.xml", records_and("delaySeconds", cf::Value::Float64(2.5)));
+  Seed("usage", "delay-too-long.xml", records_and("delaySeconds", cf::Value::SInt64(5000)));
+  Seed("usage", "delay-not-a-number.xml", records_and("delaySeconds", "soon"));
+  Seed("usage", "never-reply-not-a-boolean.xml", xml(usage_file({{"neverReply", cf::Value::SInt64(1)}})));
+  Seed("usage", "records-not-an-array.xml", xml(usage_file({{"records", maps}})));
+  Seed("usage", "no-records.xml", xml(usage_file({})));
+  cf::Dictionary nameless = *usage_record("", today, 1, 2, 3, 4).AsDictionary();
+  cf::Dictionary text_counter = *usage_record("Text", today, 1, 2, 3, 4).AsDictionary();
+  text_counter.Set("wwanOutBytes", "12");
+  cf::Dictionary undated = *usage_record("Undated", today, 1, 2, 3, 4).AsDictionary();
+  undated.Remove(cf::Value("sinceTime"));
+  // The start dates at the ends of what the preferences keep (the XML
+  // writer brings the far ones to years 1 and 9999).
+  auto odd_records = [&](const cf::Value& early, const cf::Value& far) {
+    return usage_file({{"records", cf::Array({cf::Value(nameless), cf::Value(text_counter), cf::Value(undated),
+                                              usage_record("Far", far, 1, 2, 3, 4),
+                                              usage_record("Early", early, 1, 2, 3, 4),
+                                              usage_record("Extremes", today, INT64_MAX, INT64_MIN, -1, 1 << 10),
+                                              usage_record("Twice", today, 1 << 20, 0, 0, 0),
+                                              usage_record("Twice", yesterday, 1 << 21, 0, 0, 0), "x"})}});
+  };
+  Seed("usage", "odd-records.xml", xml(odd_records(cf::Date{-7e10}, cf::Date{4e11})));
+  // Beyond them: the binary writer clamps dates to 32-bit seconds from
+  // 2001, so two placeholder dates are overwritten in its output.
+  constexpr double kBinaryDateEpoch = 978307200;
+  auto date_item = [&](double seconds) {
+    const double from_2001 = seconds - kBinaryDateEpoch;
+    uint64_t bits;
+    std::memcpy(&bits, &from_2001, 8);
+    return "\x33" + BigEndian(bits, 8);
+  };
+  std::string beyond = binary(odd_records(cf::Date{kBinaryDateEpoch + 1111111}, cf::Date{kBinaryDateEpoch + 2222222}));
+  for (const auto& [placeholder, date] : {std::pair{1111111.0, -7e10}, std::pair{2222222.0, 4e11}})
+    if (const size_t at = beyond.find(date_item(kBinaryDateEpoch + placeholder)); at != std::string::npos)
+      beyond.replace(at, 9, date_item(date));
+  Seed("usage", "odd-records-beyond.bplist", beyond);
+  const std::string records_xml = xml(usage_file({{"records", usage_records}}));
+  Seed("usage", "truncated.xml", records_xml.substr(0, records_xml.size() - 40));
+  Seed("usage", "not-a-dictionary.xml", xml(usage_records));
+  Seed("usage", "junk", "not a property list");
   return 0;
 }

@@ -25,7 +25,7 @@ cmake --build build-fuzz --target fuzz_all
 rm -rf build-fuzz/corpus
 build-fuzz/fuzz/fuzz_seeds build-fuzz/corpus
 for target in ftl stats msp snapshot snapshot_inplace plist kcdata registry service_frames validity defects \
-  telemetry ioreport_legend ioreport_raw health_page block_stat; do
+  telemetry ioreport_legend ioreport_raw health_page block_stat controller_lists hub ean stackshot usage; do
   echo "replaying the $target corpus"
   build-fuzz/fuzz/fuzz_$target build-fuzz/corpus/$target -runs=0
 done

@@ -1,4 +1,5 @@
 // Samples as text, and text to a descriptor.
+#include <cmath>
 #include <cstring>
 
 #include "cf/format.h"
@@ -40,6 +41,12 @@ cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::
     std::memcpy(&id, sample.Get("RawElements").AsData()->data() + 8, 8);
     name = cf::Format("%#llx", id).substr(0, 9);
   }
+  // What every state of a state channel shares is worked out once, not once
+  // per state: a legend may claim 65535 states.
+  double state_total = 0;
+  bool state_names = true;
+  for (size_t k = 0; format == kIOReportFormatState && k < count; ++k)
+    state_total += static_cast<double>(IOReportStateGetResidency(sample, static_cast<int>(k)));
   std::string text;
   for (size_t k = 0; k < count; ++k) {
     const int i = static_cast<int>(k);
@@ -54,7 +61,10 @@ cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::
         const int64_t transitions = IOReportStateGetInTransitions(sample, i);
         const int64_t residency = IOReportStateGetResidency(sample, i);
         if (!present(transitions) || !present(residency)) return cf::Value();
-        cf::Value state = IOReportStateGetNameForIndex(sample, i);
+        cf::Value state = state_names ? IOReportStateGetNameForIndex(sample, i) : cf::Value();
+        // Names are kept in the sample once all of them render; when none
+        // was kept, no index has one.
+        if (state.IsNull() && !sample.Get("StateNames").AsArray()) state_names = false;
         if (state.IsNull())
           state = cf::Format("%#llx", static_cast<uint64_t>(IOReportStateGetIDForIndex(sample, i))).substr(0, 19);
         const double seconds =
@@ -62,7 +72,7 @@ cf::Value IOReportSampleCopyDescription(const cf::Dictionary& sample, const cf::
                                kSecondsUnit);
         text += cf::Format("%s%20s[%8s] = { # %-8llu %9.3e %s / %4.1f%% }\n", lead, name, state,
                            static_cast<uint64_t>(transitions), seconds, "s",
-                           IOReportStateGetDutyCycle(sample, i) * 100);
+                           (state_total == 0 ? std::nan("") : static_cast<double>(residency) / state_total) * 100);
         break;
       }
       case kIOReportFormatHistogram: {
