@@ -29,15 +29,11 @@
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/log.h"
+#include "scratch_root.h"
 #include "sim/device.h"
 #include "sim/user_clients.h"
 
 namespace {
-
-class NullLog : public platform::LogSink {
- public:
-  void Write(platform::LogLevel, std::string_view) override {}
-};
 
 class HubFiles : public sim::DeviceFiles {
  public:
@@ -57,13 +53,6 @@ constexpr uint32_t kOpen = 0, kConfigureInterests = 2, kUpdate = 3;
 constexpr size_t kElement = 64;
 constexpr size_t kMaxBuffer = size_t{64} << 20;
 
-std::string g_root;
-std::unique_ptr<platform::ContextScope> g_scope;
-
-void RemoveRoot() {
-  std::error_code ec;
-  std::filesystem::remove_all(g_root, ec);
-}
 
 cf::Value Parse(std::string_view bytes) {
   cf::ParseResult parsed = cf::ParsePropertyList(bytes);
@@ -114,13 +103,7 @@ void CheckBuffer(std::string_view buffer, const std::set<std::pair<uint64_t, uin
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  std::string tmpl = (std::filesystem::temp_directory_path() / "fuzz-hub-XXXXXX").string();
-  if (!mkdtemp(tmpl.data())) std::abort();
-  g_root = tmpl;
-  std::atexit(RemoveRoot);
-  // Whatever the reporting code logs goes nowhere.
-  g_scope = std::make_unique<platform::ContextScope>(
-      g_root, platform::Backends{std::make_shared<platform::FixedClock>(1.75e9), std::make_shared<NullLog>()});
+  fuzz::ScratchRoot("hub");  // whatever the reporting code writes or logs stays there
   return 0;
 }
 

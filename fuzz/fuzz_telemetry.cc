@@ -17,22 +17,12 @@
 #include "platform/clock.h"
 #include "platform/context.h"
 #include "platform/log.h"
+#include "scratch_root.h"
 #include "storagelog/telemetry.h"
 
 namespace {
 
-class NullLog : public platform::LogSink {
- public:
-  void Write(platform::LogLevel, std::string_view) override {}
-};
-
 std::string g_root;
-std::unique_ptr<platform::ContextScope> g_scope;
-
-void RemoveRoot() {
-  std::error_code ec;
-  std::filesystem::remove_all(g_root, ec);
-}
 
 // Records logged since the last call, which removes them.
 size_t TakeRecords() {
@@ -50,13 +40,8 @@ size_t TakeRecords() {
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  std::string tmpl = (std::filesystem::temp_directory_path() / "fuzz-telemetry-XXXXXX").string();
-  if (!mkdtemp(tmpl.data())) std::abort();
-  g_root = tmpl;
-  std::atexit(RemoveRoot);
   // Lives for the whole run: every record goes under the scratch root.
-  g_scope = std::make_unique<platform::ContextScope>(
-      g_root, platform::Backends{std::make_shared<platform::FixedClock>(1.75e9), std::make_shared<NullLog>()});
+  g_root = fuzz::ScratchRoot("telemetry");
   return 0;
 }
 

@@ -34,36 +34,17 @@
 #include "platform/log.h"
 #include "platform/prefs.h"
 #include "platform/usage.h"
+#include "scratch_root.h"
 
 namespace {
 
-class NullLog : public platform::LogSink {
- public:
-  void Write(platform::LogLevel, std::string_view) override {}
-};
-
-// 2025-06-15 15:06:40 UTC; the seeds date their records from it.
-constexpr double kNow = 1.75e9;
 
 std::string g_root;
-std::unique_ptr<platform::ContextScope> g_scope;
 std::unique_ptr<UsageFeed> g_feed;
 // Replies that came for a file that should have had none. They arrive on
 // the service's thread, so the input after the one at fault may notice.
 std::atomic<int> g_unexpected_replies{0};
 
-void RemoveRoot() {
-  std::error_code ec;
-  std::filesystem::remove_all(g_root, ec);
-}
-
-// The scratch root lives in memory where it can: the handler syncs the
-// preferences file on every reply.
-std::string ScratchParent() {
-  std::error_code ec;
-  if (std::filesystem::is_directory("/dev/shm", ec) && access("/dev/shm", W_OK) == 0) return "/dev/shm";
-  return std::filesystem::temp_directory_path().string();
-}
 
 struct Request {
   std::counting_semaphore<> done{0};
@@ -107,16 +88,10 @@ void CheckBaseline(size_t records) {
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  std::string tmpl = ScratchParent() + "/fuzz-usage-XXXXXX";
-  if (!mkdtemp(tmpl.data())) std::abort();
-  g_root = tmpl;
-  std::atexit(RemoveRoot);
-  std::string error;
-  if (!platform::WriteRootMarker(g_root, &error)) std::abort();
+  // In memory where it can be (the handler syncs the preferences file on
+  // every reply), for the whole run, so the store and preferences stay open.
+  g_root = fuzz::ScratchRoot("usage");
   std::filesystem::create_directories(g_root + "/device");
-  // Lives for the whole run, so the store and preferences stay open.
-  g_scope = std::make_unique<platform::ContextScope>(
-      g_root, platform::Backends{std::make_shared<platform::FixedClock>(kNow), std::make_shared<NullLog>()});
   g_feed = std::make_unique<UsageFeed>(std::make_shared<AnalyticsWorkspace>(kVitalisAnalyticsServiceEndpoint));
   return 0;
 }

@@ -335,6 +335,7 @@ bool FKLogStructuredData(int type, const cf::Value& record) {
     static std::mutex mu;
     static std::map<std::string, int> logged;
     std::lock_guard<std::mutex> lock(mu);
+    if (logged.size() >= 100000) logged.clear();  // a process of endless records (a fuzzer) stays bounded
     identity += " #" + std::to_string(++logged[LineId(identity)]);
   }
   const std::string id = LineId(identity);
