@@ -62,7 +62,9 @@ bool AnalyticsSendEventLazy(std::string_view event, const std::function<cf::Valu
     return false;
   }
   line += '\n';
-  platform::AppendOnce once{mark};
+  // A run's events are a few hundred KiB at most: the repeated run's
+  // predecessor wrote its own among the last 2 MiB.
+  platform::AppendOnce once{mark, int64_t{2} << 20};
   const bool ok =
       platform::AppendToFile(platform::Context::Current().Path("/var/eventlens/events.jsonl"), line, &error, &once);
   if (!ok) platform::LogError("Cannot record event %s: %s", std::string(event), error);
